@@ -1,0 +1,8 @@
+/* The Plano engine: one include for the whole C interface. */
+#ifndef PLANO_PLANO_H
+#define PLANO_PLANO_H
+
+#include "pellux/pellux.h"
+#include "plano/plano_base.h"
+
+#endif
