@@ -4,5 +4,8 @@
 
 #include "pellux/pellux.h"
 #include "plano/plano_base.h"
+#include "plano/threads.h"
+#include "plano/four_point.h"
+#include "plano/fixed_corner_camera.h"
 
 #endif

@@ -8,6 +8,7 @@
 #include "pellux/fixed.h"
 #include "pellux/matrix.h"
 #include "pellux/geometry.h"
+#include "pellux/rotation.h"
 #include "pellux/camera.h"
 #include "pellux/list.h"
 #include "pellux/memory.h"
