@@ -7,5 +7,7 @@
 #include "plano/threads.h"
 #include "plano/four_point.h"
 #include "plano/fixed_corner_camera.h"
+#include "plano/sumo.h"
+#include "plano/projective_warp.h"
 
 #endif

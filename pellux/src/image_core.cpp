@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "image_internal.hpp"
+#include "image_ops.hpp"
 #include "pellux/detail/util.hpp"
 
 namespace plx {
@@ -79,6 +80,9 @@ bool allocate_pixels(Plx_Image *image, const char *function)
         image->block_size = bytes;
     }
     image->data = image->block;
+    // Bit rows end in padding bits that whole-word readers (counts, logic, run coding) take
+    // as pixels; they start zero, and every writer leaves them so.
+    if (image->type == PLX_TYPE_BIT) std::memset(image->data, 0, bytes);
     return true;
 }
 
@@ -246,8 +250,16 @@ PLX_API Plx_Image *plx_image_extract_q(const Plx_Image *source, Plx_Window windo
                                        Plx_ImageFormat format, Plx_PixelType type,
                                        Plx_Bool copy, Plx_Image *dest)
 {
-    if (source == nullptr || (dest != nullptr && dest == source)) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, source ? "dest is the source" : "null source", 0);
+    if (!plx::check_image(source, __func__)) return nullptr;
+    if (dest == source) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "dest is the source", 0);
+        return nullptr;
+    }
+    // dest's own pixels are released or rewritten below: they must not be the ones being read.
+    if (dest != nullptr && dest->block != nullptr && source->data != nullptr &&
+        static_cast<const char *>(source->data) >= static_cast<const char *>(dest->block) &&
+        static_cast<const char *>(source->data) < static_cast<const char *>(dest->block) + dest->block_size) {
+        PLX_ERR_START(PLX_ERROR_INCOMPATIBLE, "dest holds the source's pixels", 0);
         return nullptr;
     }
     if (!plx::window_inside(source, window)) {
@@ -272,7 +284,10 @@ PLX_API Plx_Image *plx_image_extract_q(const Plx_Image *source, Plx_Window windo
             if (dest == nullptr) return nullptr;
             owned = true;
         } else {
-            plx_image_free(dest);  // a view owns no pixels; release what dest held before
+            // A view owns no pixels: release the ones dest held, but keep the record itself
+            // (and whether it came from the heap) as the caller made it.
+            owned = dest->owned != 0;
+            std::free(dest->block);
         }
         *dest = *source;
         dest->block = nullptr;
@@ -293,6 +308,8 @@ PLX_API Plx_Image *plx_image_extract_q(const Plx_Image *source, Plx_Window windo
         return dest;
     }
 
+    // Refuse an impossible conversion before dest is touched.
+    if (!plx::check_conversion(source->format, source->type, format, type, __func__)) return nullptr;
     bool owned = dest == nullptr;
     if (owned) {
         dest = plx_image_form_gen(nullptr, format, type, window.height, window.width);
@@ -301,12 +318,18 @@ PLX_API Plx_Image *plx_image_extract_q(const Plx_Image *source, Plx_Window windo
             return nullptr;
         }
     } else {
-        bool was_view = dest->block == nullptr && dest->data != nullptr;
-        if (was_view) *dest = Plx_Image{};  // drop the view; it owns nothing
-        if (!plx_image_set_gen(dest, format, type, window.height, window.width)) {
+        // A view is dropped (it owns nothing) and dest gets pixels of its own; the record
+        // changes only once that has succeeded.
+        Plx_Image updated = *dest;
+        if (updated.block == nullptr && updated.data != nullptr) {
+            updated = Plx_Image{};
+            updated.owned = dest->owned;
+        }
+        if (!plx_image_set_gen(&updated, format, type, window.height, window.width)) {
             PLX_ERR_PASS();
             return nullptr;
         }
+        *dest = updated;
     }
     if (!plx::copy_window_converted(source, window, dest)) {
         PLX_ERR_PASS();

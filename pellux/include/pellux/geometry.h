@@ -21,7 +21,10 @@ extern "C" {
 PLX_API Plx_Bool plx_homog33_increment_p(Plx_SquMatrix *A, const Plx_Vector3 *x,
                                          const Plx_Vector3 *xp);
 /* H from the accumulator; equations is the number of equation rows added (2 per pair) and
- * must be at least 8 (code 24). H has unit Frobenius norm. */
+ * must be at least 8 (code 24). H has unit Frobenius norm and its largest-magnitude entry
+ * positive. Pairs that leave H undetermined (a second eigenvalue at rounding level once the
+ * accumulator is equilibrated: coincident or collinear points) fail with code 7. The fit is
+ * only as well conditioned as the data: normalise the points first (plx_points_normalise). */
 PLX_API Plx_Bool plx_homog33_solve(const Plx_SquMatrix *A, uint32_t equations, Plx_Matrix33 *H);
 
 /* Incremental linear least squares: accumulates A^T W A and A^T W b one equation at a time
@@ -36,16 +39,19 @@ typedef struct Plx_PseudoInverseSolver {
 
 PLX_API Plx_PseudoInverseSolver *plx_psinv_form(Plx_PseudoInverseSolver *solver, uint32_t unknowns);
 PLX_API void plx_psinv_reset(Plx_PseudoInverseSolver *solver);
-/* Adds one equation row . p = rhs with weight w. */
+/* Adds one equation row . p = rhs with weight w and counts it in equations; a non-finite
+ * weight or rhs fails with code 32. (Forming a solver of 0 unknowns fails with code 32.) */
 PLX_API Plx_Bool plx_psinv_increment(Plx_PseudoInverseSolver *solver, const double *row,
                                      double rhs, double weight);
 /* Solves for the unknowns; fewer equations than unknowns fail with code 24, a singular
- * system with code 18. */
+ * system (an unknown no equation touches, or a pivot at rounding level once the normal
+ * equations are equilibrated) with code 18. */
 PLX_API Plx_Bool plx_psinv_solve(Plx_PseudoInverseSolver *solver, double *solution);
 PLX_API void plx_psinv_free(Plx_PseudoInverseSolver *solver);
 
 /* Adds the pair x -> xp (dehomogenised) to a six-unknown solver: the map
- * (u, v) -> (a u + b v + c, d u + e v + f). */
+ * (u, v) -> (a u + b v + c, d u + e v + f). A solver of another size fails with code 7, a
+ * point with w = 0 with code 18. */
 PLX_API Plx_Bool plx_affine33_increment_p(Plx_PseudoInverseSolver *solver, const Plx_Vector3 *x,
                                           const Plx_Vector3 *xp);
 /* The affine map [[a, b, c], [d, e, f]]; equations is the number of equation rows added and

@@ -5,17 +5,28 @@
  * a view of part of another image shares its pixels and only changes data, size and offset.
  *
  * Bit images (type PLX_TYPE_BIT, grey format) store each row as 32-bit words; pixel c of a row
- * is bit (c mod 32) of word c / 32. Bits past the width in the last word are kept zero by every
- * operation that writes whole words.
+ * is bit (c mod 32) of word c / 32. The bits past the width in the last word start zero in an
+ * image that owns its pixels and no operation changes them (in a view they are the parent's
+ * pixels); no operation reads them as pixels.
  *
  * Pixel values: unsigned char and unsigned short are normalised (255 and 65535 stand for 1.0),
  * float and double hold the value itself (1.0 is full scale), bits are 0 or 1 (1 is full scale);
  * int and unsigned int are plain numbers. Type conversion rescales between the normalised and
- * floating types (rounding to nearest and clamping into integer ranges) and converts int and
- * unsigned int by value.
+ * floating types (rounding to nearest, halves away from zero, and clamping into integer ranges)
+ * and converts int and unsigned int by value; a bit is set from half of full scale upwards.
+ * Format conversion: colour to grey through plx_rgb_to_luminance, grey to colour by
+ * repetition, alpha dropped or, where the source has none, full scale; BGR order is honoured.
+ * Vector fields convert only to vector fields (a missing z is 0) and pointers only to
+ * pointers: codes 39 and 38 otherwise.
+ *
+ * Destinations: a null dest makes a new heap record; a zeroed record or an image is (re)formed
+ * to the result's format, type and size, unless it has them already (then its pixels, and its
+ * place in a larger image when it is a view, are written in place); a view of another shape
+ * fails with code 7. Failing calls leave dest unchanged, except where noted.
  *
  * Windows (Plx_Window) given to image operations are in the image's own pixel coordinates;
- * the frame offset is never subtracted unless a function says so. */
+ * the frame offset is never subtracted unless a function says so. A window must lie inside
+ * the image (code 32). */
 #ifndef PELLUX_IMAGE_H
 #define PELLUX_IMAGE_H
 
@@ -122,8 +133,10 @@ PLX_API Plx_Image *plx_image_form_gen_b(Plx_Image *image, int32_t height, int32_
 PLX_API Plx_Image *plx_image_form_gen_p(Plx_Image *image, int32_t height, int32_t width);
 
 /* ---- single pixels ----
- * Values are passed as doubles, one per channel in the format's order; bits are 0 or 1.
- * Coordinates outside the image fail with code 32. */
+ * Values are the stored numbers as doubles (255.0 for a full unsigned char), one per channel
+ * in the format's order (BGR: blue first); bits are 0 or 1. Setting rounds to nearest and
+ * clamps to the type (a bit is set from 0.5). Coordinates outside the image fail with code
+ * 32, pointer images with code 38. */
 PLX_API Plx_Bool plx_image_get_pixel(const Plx_Image *image, int32_t row, int32_t col,
                                      double *values);
 PLX_API Plx_Bool plx_image_set_pixel(Plx_Image *image, int32_t row, int32_t col,
@@ -133,15 +146,19 @@ PLX_API Plx_Bool plx_image_set_pixel(Plx_Image *image, int32_t row, int32_t col,
  * the source has none). */
 PLX_API Plx_Bool plx_image_convert_pixel(const Plx_Image *source, int32_t srow, int32_t scol,
                                          Plx_Image *dest, int32_t drow, int32_t dcol);
+/* Bit and pointer accessors: a bad image or position registers code 32/38 and reads 0/null
+ * or writes nothing. */
 PLX_API Plx_Bool plx_image_get_bit(const Plx_Image *image, int32_t row, int32_t col);
 PLX_API void plx_image_set_bit(Plx_Image *image, int32_t row, int32_t col, Plx_Bool value);
 PLX_API void *plx_image_get_pointer(const Plx_Image *image, int32_t row, int32_t col);
 PLX_API void plx_image_set_pointer(Plx_Image *image, int32_t row, int32_t col, void *value);
 
 /* ---- fill ---- */
+/* Zero fill works on every type (pointer images get null pointers). */
 PLX_API Plx_Bool plx_image_fill_zero(Plx_Image *image);
 PLX_API Plx_Bool plx_image_fill_zero_window(Plx_Image *image, Plx_Window window);
-/* values: one double per channel, converted to the pixel type. */
+/* values: one double per channel, stored as plx_image_set_pixel stores them (pointer images:
+ * code 38). */
 PLX_API Plx_Bool plx_image_fill_const(Plx_Image *image, const double *values);
 PLX_API Plx_Bool plx_image_fill_const_window(Plx_Image *image, Plx_Window window,
                                              const double *values);
@@ -150,29 +167,36 @@ PLX_API Plx_Bool plx_image_fill_const_window(Plx_Image *image, Plx_Window window
  * plx_image_extract_q: dest becomes the window of source. copy 0: a view sharing source's
  * pixels (format and type must be PLX_FORMAT_NONE/PLX_TYPE_NONE or source's own; a bit view
  * needs a window x that is a multiple of 32). copy 1: dest is (re)formed with the window's size
- * and the given format and type (NONE = source's) and the pixels are copied and converted.
- * The result's frame offset is source's offset plus the window origin. A window not inside the
- * image fails with code 32. Returns dest, or a new record when dest is null. */
+ * and the given format and type (NONE = source's) and the pixels are copied and converted (a
+ * view given as dest is dropped, not written through). Either way dest's old pixels are
+ * released, so they must not hold source's (code 7). The result's frame offset is source's
+ * offset plus the window origin. A window not inside the image fails with code 32. Returns
+ * dest, or a new record when dest is null. */
 PLX_API Plx_Image *plx_image_extract_q(const Plx_Image *source, Plx_Window window,
                                        Plx_ImageFormat format, Plx_PixelType type,
                                        Plx_Bool copy, Plx_Image *dest);
-/* One channel of source as a grey image of the given type (NONE = source's), copied. */
+/* One channel of source (index in the format's order, as plx_image_get_pixel gives them;
+ * code 32 past the last) as a grey image of the given type (NONE = source's), copied; dest
+ * takes source's frame offset. */
 PLX_API Plx_Image *plx_image_extract_channel_q(const Plx_Image *source, uint32_t channel,
                                                Plx_PixelType type, Plx_Image *dest);
-/* The whole image converted to another format and type (dest formed to source's size). */
+/* The whole image converted to another format and type (NONE = source's), dest formed to
+ * source's size and given its frame offset. dest may not be source (code 32). */
 PLX_API Plx_Image *plx_image_convert_q(const Plx_Image *source, Plx_ImageFormat format,
                                        Plx_PixelType type, Plx_Image *dest);
 
 /* ---- active subwindows ----
- * The active subwindow of a bit image is the bounding box of its set pixels (zero size when
- * none is set); of another image, the bounding box of its pixels with any nonzero channel. */
+ * The active subwindow of a bit image is the bounding box of its set pixels ({0, 0, 0, 0}
+ * when none is set); of another image, the bounding box of its pixels with any nonzero channel
+ * (non-null, for pointers). plx_image_get_active_subwindow_b takes only bit images (code 38). */
 PLX_API Plx_Bool plx_image_get_active_subwindow_b(const Plx_Image *image, Plx_Window *window);
 PLX_API Plx_Bool plx_image_get_active_subwindow(const Plx_Image *image, Plx_Window *window);
 
 /* ---- bit-image logic ----
- * All operands are bit images of equal size; dest may be either operand. dest is formed when
- * it is a zeroed record. Dilation grows set pixels by radius pixels along rows (_x) or columns
- * (_y), so the two in turn give a square neighbourhood. */
+ * All operands are bit images (code 38) of equal size (code 7); dest (not null) may be either
+ * operand itself, but not a differently placed view of one. Dilation grows set pixels by
+ * radius pixels along rows (_x) or columns (_y), so the two in turn give a square
+ * neighbourhood; radius 0 copies. */
 PLX_API Plx_Bool plx_image_bit_and_q(const Plx_Image *a, const Plx_Image *b, Plx_Image *dest);
 PLX_API Plx_Bool plx_image_bit_or_q(const Plx_Image *a, const Plx_Image *b, Plx_Image *dest);
 PLX_API Plx_Bool plx_image_bit_eor_q(const Plx_Image *a, const Plx_Image *b, Plx_Image *dest);
@@ -182,12 +206,14 @@ PLX_API Plx_Bool plx_image_bit_andnot_q(const Plx_Image *a, const Plx_Image *b, 
 PLX_API Plx_Bool plx_image_bit_invert_q(const Plx_Image *a, Plx_Image *dest);
 PLX_API Plx_Bool plx_image_bit_dilate_x_q(const Plx_Image *a, uint32_t radius, Plx_Image *dest);
 PLX_API Plx_Bool plx_image_bit_dilate_y_q(const Plx_Image *a, uint32_t radius, Plx_Image *dest);
-/* Number of set pixels. */
+/* Number of set pixels (0 with a trace record when image is not a bit image). */
 PLX_API uint32_t plx_image_bit_count(const Plx_Image *image);
 
 /* ---- halving ----
  * dest gets floor(height/2) x floor(width/2) pixels, each the mean of its 2x2 source block
- * (bits: set when all four are set). dest is formed with source's format and type. */
+ * (integers rounded to nearest, halves upwards; vector fields averaged as they are; bits: set
+ * when all four are set); an odd last row or column is dropped. dest has source's format and
+ * type and the frame offset floor(offset / 2). Pointer images: code 38; dest == source: 32. */
 PLX_API Plx_Image *plx_image_halve_size(const Plx_Image *source, Plx_Image *dest);
 
 /* ---- 1D convolution ----
@@ -217,7 +243,7 @@ PLX_API Plx_Bool plx_image_convolve1Dy_q(const Plx_Image *source, int32_t channe
 /* ---- pyramids ----
  * Level 0 holds the caller's image and mask (borrowed, never freed by the pyramid); level l+1
  * is level l halved (plx_image_halve_size), its mask bit set when all four finer bits are set.
- * Images of levels >= 1 are owned by the pyramid. */
+ * Images of levels >= 1 are owned by the pyramid. Start from a zeroed record. */
 typedef struct Plx_PyramidLevel {
     Plx_Image *image;
     Plx_Image *mask;  /* bit image or null */
@@ -229,8 +255,11 @@ typedef struct Plx_ImagePyramid {
     uint32_t capacity;        /* entries allocated in level */
 } Plx_ImagePyramid;
 
-/* Builds no_levels levels into pyramid, reusing its level storage and owned images where
- * they already have the right size. */
+/* Builds no_levels levels into pyramid, reusing its level array and its owned images (their
+ * pixel memory, when large enough); storage past no_levels is kept for later builds. mask,
+ * when given, is a bit image of image's size (codes 38, 7). no_levels must be at least 1 and
+ * leave every level at least 1 x 1 (code 32). image must not be one of the pyramid's own
+ * level images. A build that fails part way leaves no_levels at the levels made. */
 PLX_API Plx_Bool plx_image_pyramid_build_preallocated(Plx_ImagePyramid *pyramid,
                                                       Plx_Image *image, Plx_Image *mask,
                                                       uint32_t no_levels);
@@ -240,7 +269,8 @@ PLX_API void plx_image_pyramid_free(Plx_ImagePyramid *pyramid);
 /* ---- colour ---- */
 /* Rec. 709 luminance 0.2126 R + 0.7152 G + 0.0722 B. */
 PLX_API double plx_rgb_to_luminance(double r, double g, double b);
-/* An RGB, RGBA, BGR or BGRA image to grey (alpha dropped) of the given type (NONE = same). */
+/* An RGB, RGBA, BGR or BGRA image (else code 39) to grey (alpha dropped) of the given type
+ * (NONE = same), as plx_image_convert_q. */
 PLX_API Plx_Image *plx_image_colour_to_grey_q(const Plx_Image *source, Plx_PixelType type,
                                               Plx_Image *dest);
 /* 256 floats: lookup_table_8bit[i] = i / 255. */

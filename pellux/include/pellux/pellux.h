@@ -9,6 +9,7 @@
 #include "pellux/matrix.h"
 #include "pellux/geometry.h"
 #include "pellux/rotation.h"
+#include "pellux/numeric.h"
 #include "pellux/camera.h"
 #include "pellux/list.h"
 #include "pellux/memory.h"

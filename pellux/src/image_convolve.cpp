@@ -1,0 +1,716 @@
+// 1D convolution along rows and columns, and Gaussian masks.
+//
+// This is the hot path of smoothing and pyramids, so each line is worked in an accumulator
+// type (float for 8/16-bit and float pixels, double for the 32-bit integer and double pixels;
+// 16-bit fixed point for 8-bit pixels under a Gaussian on AVX2 machines, see below):
+//   along x: each source row is converted once into a padded line with the edge rule
+//            applied, and every output value is sum_t k[t] * line[i + t * lanes];
+//   along y: each output row is sum_t k[t] * row(y + t - r), the source rows taken straight
+//            from the image (float and double, all channels) or converted once into a ring
+//            of 2r+1 rows.
+// Both are the same kernel: out[i] = sum_t k[t] * src[t][i] over a flat run of values. It
+// keeps four vector accumulators in registers across all taps, folds mirrored taps of a
+// symmetric mask into one multiply, and is compiled twice (AVX2+FMA and the baseline) with a
+// one-time choice by CPU. Every value goes through the same vector arithmetic whatever its
+// position in the run (a ragged tail is staged through a full vector), so results do not
+// depend on the window or band an image is cut into. They may differ in the last bit (last
+// level for integer pixels) between machines with and without AVX2.
+#include <algorithm>
+#include <cmath>
+#include <cstdlib>
+#include <cstring>
+#include <type_traits>
+
+#include "image_internal.hpp"
+#include "pellux/detail/pixel_traits.hpp"
+#include "pellux/detail/util.hpp"
+
+#if defined(__x86_64__) || defined(__i386__)
+#define PLX_X86 1
+#include <immintrin.h>
+#endif
+
+#define PLX_INLINE [[gnu::always_inline]] inline
+
+namespace {
+
+// ---- vector lanes of the accumulator types ----
+
+template <class A>
+struct Lanes;
+template <>
+struct Lanes<float> {
+    typedef float V __attribute__((vector_size(32)));
+    static constexpr std::size_t W = 8;
+};
+template <>
+struct Lanes<double> {
+    typedef double V __attribute__((vector_size(32)));
+    static constexpr std::size_t W = 4;
+};
+
+// 8-bit pixels under a symmetric mask of small positive taps (a Gaussian) go through 16-bit
+// fixed point: values scaled by 128, taps by 2^17, products rounded down in units of 1/256
+// (with the expected loss added back once), so sixteen values go through each instruction.
+template <>
+struct Lanes<uint16_t> {
+    static constexpr std::size_t W = 16;
+};
+
+#ifdef PLX_X86
+// out[i] = bias + sum of mulhi(src[t][i] + src[ntaps-1-t][i], k[t]) (+ the centre tap), for
+// i < n, n a multiple of 16. Saturating sums: a mask summing to a little over 1 cannot wrap.
+[[gnu::target("avx2")]] void fixed_taps_avx2(uint16_t *out, const uint16_t *const *src, const uint16_t *k,
+                                             uint32_t ntaps, std::size_t n)
+{
+    const uint32_t r = ntaps / 2;
+    const __m256i bias = _mm256_set1_epi16(static_cast<short>((r + 1) / 2));
+    std::size_t i = 0;
+    for (; i + 64 <= n; i += 64) {
+        __m256i a0 = bias, a1 = bias, a2 = bias, a3 = bias;
+        for (uint32_t t = 0; t < r; ++t) {
+            const __m256i kt = _mm256_set1_epi16(static_cast<short>(k[t]));
+            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
+            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
+            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q)), kt));
+            a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 1), _mm256_loadu_si256(q + 1)), kt));
+            a2 = _mm256_adds_epu16(a2, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 2), _mm256_loadu_si256(q + 2)), kt));
+            a3 = _mm256_adds_epu16(a3, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 3), _mm256_loadu_si256(q + 3)), kt));
+        }
+        const __m256i kc = _mm256_set1_epi16(static_cast<short>(k[r]));
+        const __m256i *c = reinterpret_cast<const __m256i *>(src[r] + i);
+        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_loadu_si256(c), kc));
+        a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 1), kc));
+        a2 = _mm256_adds_epu16(a2, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 2), kc));
+        a3 = _mm256_adds_epu16(a3, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 3), kc));
+        __m256i *o = reinterpret_cast<__m256i *>(out + i);
+        _mm256_storeu_si256(o, a0);
+        _mm256_storeu_si256(o + 1, a1);
+        _mm256_storeu_si256(o + 2, a2);
+        _mm256_storeu_si256(o + 3, a3);
+    }
+    for (; i + 32 <= n; i += 32) {
+        __m256i a0 = bias, a1 = bias;
+        for (uint32_t t = 0; t < r; ++t) {
+            const __m256i kt = _mm256_set1_epi16(static_cast<short>(k[t]));
+            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
+            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
+            const __m256i s0 = _mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q));
+            const __m256i s1 = _mm256_add_epi16(_mm256_loadu_si256(p + 1), _mm256_loadu_si256(q + 1));
+            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(s0, kt));
+            a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(s1, kt));
+        }
+        const __m256i kc = _mm256_set1_epi16(static_cast<short>(k[r]));
+        const __m256i *c = reinterpret_cast<const __m256i *>(src[r] + i);
+        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_loadu_si256(c), kc));
+        a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 1), kc));
+        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i), a0);
+        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i + 16), a1);
+    }
+    for (; i + 16 <= n; i += 16) {
+        __m256i a0 = bias;
+        for (uint32_t t = 0; t < r; ++t) {
+            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
+            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
+            const __m256i s0 = _mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q));
+            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(s0, _mm256_set1_epi16(static_cast<short>(k[t]))));
+        }
+        const __m256i c0 = _mm256_loadu_si256(reinterpret_cast<const __m256i *>(src[r] + i));
+        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(c0, _mm256_set1_epi16(static_cast<short>(k[r]))));
+        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i), a0);
+    }
+}
+#endif
+
+// ---- the kernel ----
+
+// out[i] = sum_t k[t] * src[t][i] for i < n, n a multiple of the vector width. With Sym the
+// mask is symmetric (k[t] == k[ntaps-1-t]) and mirrored taps share one multiply.
+template <class A, bool Sym>
+PLX_INLINE void taps_run_float(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
+{
+    using V = typename Lanes<A>::V;
+    constexpr std::size_t W = Lanes<A>::W;
+    const uint32_t r = ntaps / 2;
+    std::size_t i = 0;
+    for (; i + 4 * W <= n; i += 4 * W) {
+        V a0 = {}, a1 = {}, a2 = {}, a3 = {};
+        V x0, x1, x2, x3, y0, y1, y2, y3;
+        if constexpr (Sym) {
+            for (uint32_t t = 0; t < r; ++t) {
+                const A *p = src[t] + i, *q = src[ntaps - 1 - t] + i;
+                const A kt = k[t];
+                std::memcpy(&x0, p, sizeof x0);
+                std::memcpy(&x1, p + W, sizeof x1);
+                std::memcpy(&x2, p + 2 * W, sizeof x2);
+                std::memcpy(&x3, p + 3 * W, sizeof x3);
+                std::memcpy(&y0, q, sizeof y0);
+                std::memcpy(&y1, q + W, sizeof y1);
+                std::memcpy(&y2, q + 2 * W, sizeof y2);
+                std::memcpy(&y3, q + 3 * W, sizeof y3);
+                a0 += kt * (x0 + y0);
+                a1 += kt * (x1 + y1);
+                a2 += kt * (x2 + y2);
+                a3 += kt * (x3 + y3);
+            }
+        }
+        for (uint32_t t = Sym ? r : 0; t < (Sym ? r + 1 : ntaps); ++t) {
+            const A *p = src[t] + i;
+            const A kt = k[t];
+            std::memcpy(&x0, p, sizeof x0);
+            std::memcpy(&x1, p + W, sizeof x1);
+            std::memcpy(&x2, p + 2 * W, sizeof x2);
+            std::memcpy(&x3, p + 3 * W, sizeof x3);
+            a0 += kt * x0;
+            a1 += kt * x1;
+            a2 += kt * x2;
+            a3 += kt * x3;
+        }
+        std::memcpy(out + i, &a0, sizeof a0);
+        std::memcpy(out + i + W, &a1, sizeof a1);
+        std::memcpy(out + i + 2 * W, &a2, sizeof a2);
+        std::memcpy(out + i + 3 * W, &a3, sizeof a3);
+    }
+    for (; i + W <= n; i += W) {
+        V a0 = {}, x0, y0;
+        if constexpr (Sym) {
+            for (uint32_t t = 0; t < r; ++t) {
+                std::memcpy(&x0, src[t] + i, sizeof x0);
+                std::memcpy(&y0, src[ntaps - 1 - t] + i, sizeof y0);
+                a0 += k[t] * (x0 + y0);
+            }
+        }
+        for (uint32_t t = Sym ? r : 0; t < (Sym ? r + 1 : ntaps); ++t) {
+            std::memcpy(&x0, src[t] + i, sizeof x0);
+            a0 += k[t] * x0;
+        }
+        std::memcpy(out + i, &a0, sizeof a0);
+    }
+}
+
+template <class A, bool Sym>
+PLX_INLINE void taps_run(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
+{
+#ifdef PLX_X86
+    if constexpr (std::is_same_v<A, uint16_t>) {
+        fixed_taps_avx2(out, src, k, ntaps, n);
+        return;
+    } else
+#endif
+        taps_run_float<A, Sym>(out, src, k, ntaps, n);
+}
+
+// Scratch of one convolution call, carved from one heap block.
+template <class A>
+struct Scratch {
+    A *k;               // the mask in the accumulator type
+    A *line;            // along x: the padded source line
+    A *out;             // one output line before conversion
+    A *stage;           // ntaps + 1 vectors for a ragged tail
+    const A **src;      // ntaps source pointers
+    const A **stage_src;
+    A *ring;            // along y: converted source rows
+    int64_t *ring_row;  // the source row held by each ring slot
+    A *zero;            // along y: a line of zeros for the zero edge rule
+    uint32_t ring_rows;
+};
+
+// The kernel over any n: whole vectors in place, the tail staged through one full vector.
+template <class A, bool Sym>
+PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n,
+                           const Scratch<A> &s)
+{
+    constexpr std::size_t W = Lanes<A>::W;
+    const std::size_t whole = n - n % W;
+    taps_run<A, Sym>(out, src, s.k, ntaps, whole);
+    if (whole == n) return;
+    const std::size_t rest = n - whole;
+    for (uint32_t t = 0; t < ntaps; ++t) {
+        A *st = s.stage + std::size_t(t) * W;
+        std::memcpy(st, src[t] + whole, rest * sizeof(A));
+        for (std::size_t j = rest; j < W; ++j) st[j] = A(0);
+        s.stage_src[t] = st;
+    }
+    A *tail = s.stage + std::size_t(ntaps) * W;
+    taps_run<A, Sym>(tail, s.stage_src, s.k, ntaps, W);
+    std::memcpy(out + whole, tail, rest * sizeof(A));
+}
+
+// ---- pixel conversion ----
+
+// An accumulated value back to a pixel: rounded to nearest (halves away from zero) and
+// clamped for integer types, NaN going to the lowest value.
+template <class T, class A>
+PLX_INLINE T to_pixel(A v)
+{
+    if constexpr (std::is_same_v<A, uint16_t>) {  // fixed point, units of 1/256; 16-bit lanes
+        const uint16_t c = v < 65407 ? v : uint16_t(65407);
+        return static_cast<T>(uint16_t(c + 128) >> 8);
+    } else if constexpr (!plx::PixelTraits<T>::integral) {
+        return static_cast<T>(v);
+    } else {
+        // Strict comparisons written as selects, so the loops around this vectorise.
+        constexpr A lo = static_cast<A>(std::numeric_limits<T>::lowest());
+        constexpr A hi = static_cast<A>(std::numeric_limits<T>::max());
+        if constexpr (std::is_signed_v<T>) {
+            v = v > lo ? v : lo;
+            v = v < hi ? v : hi;
+            return static_cast<T>(v + (v < A(0) ? A(-0.5) : A(0.5)));
+        } else {
+            v = v + A(0.5);  // then truncation rounds
+            v = v > A(0) ? v : A(0);
+            v = v < hi ? v : hi;
+            if constexpr (sizeof(T) < 4)
+                return static_cast<T>(static_cast<int32_t>(v));
+            else
+                return static_cast<T>(v);
+        }
+    }
+}
+
+template <class A, class T>
+PLX_INLINE A to_accum(T v)
+{
+    if constexpr (std::is_same_v<A, uint16_t>)
+        return static_cast<A>(v << 7);  // fixed point: 8-bit levels times 128
+    else
+        return static_cast<A>(v);
+}
+
+// n pixels of `lanes` values from s (pixel step `step` values) into a flat line d.
+template <class T, class A>
+PLX_INLINE void load_line(const T *s, std::size_t n, std::size_t lanes, std::size_t step, A *d)
+{
+    if (lanes == step) {
+        const std::size_t m = n * lanes;
+        for (std::size_t j = 0; j < m; ++j) d[j] = to_accum<A>(s[j]);
+    } else {
+        for (std::size_t j = 0; j < n; ++j) d[j] = to_accum<A>(s[j * step]);
+    }
+}
+
+template <class T, class A>
+PLX_INLINE void store_line(const A *s, std::size_t n, std::size_t lanes, std::size_t step, T *d)
+{
+    if (lanes == step) {
+        const std::size_t m = n * lanes;
+        for (std::size_t j = 0; j < m; ++j) d[j] = to_pixel<T, A>(s[j]);
+    } else {
+        for (std::size_t j = 0; j < n; ++j) d[j * step] = to_pixel<T, A>(s[j]);
+    }
+}
+
+// ---- edges ----
+
+// The source index standing for position p of a line of n samples, or -1 for a zero.
+inline int64_t edge_index(int64_t p, int64_t n, Plx_EdgeBehaviour edge)
+{
+    if (p >= 0 && p < n) return p;
+    if (edge == PLX_EDGE_ZERO) return -1;
+    if (edge == PLX_EDGE_EXTEND) return p < 0 ? 0 : n - 1;
+    if (n == 1) return 0;
+    const int64_t period = 2 * (n - 1);  // reflection repeats, for masks wider than the line
+    p %= period;
+    if (p < 0) p += period;
+    return p < n ? p : period - p;
+}
+
+// ---- one pass over an image ----
+
+struct Pass {
+    const Plx_Image *source;
+    Plx_Image *dest;
+    uint32_t ntaps;
+    std::size_t step;    // values per pixel in the image
+    std::size_t lanes;   // values convolved per pixel: step, or 1 for a single channel
+    std::size_t offset;  // first convolved value within a pixel
+    Plx_EdgeBehaviour edge;
+};
+
+template <class T>
+PLX_INLINE const T *row_of(const Plx_Image *im, int64_t r, std::size_t offset)
+{
+    return static_cast<const T *>(plx_image_row(im, static_cast<int32_t>(r))) + offset;
+}
+template <class T>
+PLX_INLINE T *row_of(Plx_Image *im, int64_t r, std::size_t offset)
+{
+    return static_cast<T *>(plx_image_row(im, static_cast<int32_t>(r))) + offset;
+}
+
+template <class T, class A, bool Sym>
+PLX_INLINE void pass_x(const Pass &p, const Scratch<A> &s)
+{
+    const int64_t w = p.source->width;
+    const int64_t r = p.ntaps / 2;
+    const std::size_t lanes = p.lanes, n = std::size_t(w) * lanes;
+    const bool direct = std::is_same_v<T, A> && lanes == p.step;
+    for (uint32_t t = 0; t < p.ntaps; ++t) s.src[t] = s.line + std::size_t(t) * lanes;
+    A *inner = s.line + std::size_t(r) * lanes;
+    for (int64_t y = 0; y < p.source->height; ++y) {
+        load_line<T, A>(row_of<T>(p.source, y, p.offset), std::size_t(w), lanes, p.step, inner);
+        for (int64_t q = -r; q < 0; ++q) {
+            A *d = inner + q * int64_t(lanes);
+            const int64_t m = edge_index(q, w, p.edge);
+            for (std::size_t c = 0; c < lanes; ++c) d[c] = m < 0 ? A(0) : inner[std::size_t(m) * lanes + c];
+        }
+        for (int64_t q = w; q < w + r; ++q) {
+            A *d = inner + q * int64_t(lanes);
+            const int64_t m = edge_index(q, w, p.edge);
+            for (std::size_t c = 0; c < lanes; ++c) d[c] = m < 0 ? A(0) : inner[std::size_t(m) * lanes + c];
+        }
+        T *o = row_of<T>(p.dest, y, p.offset);
+        if (direct) {
+            apply_taps<A, Sym>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+        } else {
+            apply_taps<A, Sym>(s.out, s.src, p.ntaps, n, s);
+            store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
+        }
+    }
+}
+
+template <class T, class A, bool Sym>
+PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
+{
+    const int64_t h = p.source->height, w = p.source->width;
+    const int64_t r = p.ntaps / 2;
+    const std::size_t lanes = p.lanes, n = std::size_t(w) * lanes;
+    const bool direct = std::is_same_v<T, A> && lanes == p.step;
+    const std::size_t row_bytes = std::size_t(w) * p.step * sizeof(T);
+    constexpr int64_t kAhead = 16;
+    for (uint32_t j = 0; j < s.ring_rows; ++j) s.ring_row[j] = -1;
+    for (int64_t y = 0; y < h; ++y) {
+        // Rows of a narrow column band lie a whole stride apart, which the hardware does not
+        // prefetch: ask for the row needed a few output rows from now.
+        if (y + r + kAhead < h) {
+            const char *ahead = reinterpret_cast<const char *>(row_of<T>(p.source, y + r + kAhead, 0));
+            for (std::size_t b = 0; b < row_bytes; b += 64) __builtin_prefetch(ahead + b);
+        }
+        if (y + kAhead < h) {
+            char *ahead = reinterpret_cast<char *>(row_of<T>(p.dest, y + kAhead, 0));
+            for (std::size_t b = 0; b < row_bytes; b += 64) __builtin_prefetch(ahead + b, 1);
+        }
+        for (uint32_t t = 0; t < p.ntaps; ++t) {
+            const int64_t m = edge_index(y + t - r, h, p.edge);
+            if (m < 0) {
+                s.src[t] = s.zero;
+            } else if (direct) {
+                s.src[t] = reinterpret_cast<const A *>(row_of<T>(p.source, m, 0));
+            } else {
+                // The rows one output row needs are distinct modulo the ring size, so a row
+                // loaded here never evicts another row of the same output row.
+                const uint32_t slot = uint32_t(m % s.ring_rows);
+                A *line = s.ring + std::size_t(slot) * n;
+                if (s.ring_row[slot] != m) {
+                    load_line<T, A>(row_of<T>(p.source, m, p.offset), std::size_t(w), lanes, p.step, line);
+                    s.ring_row[slot] = m;
+                }
+                s.src[t] = line;
+            }
+        }
+        T *o = row_of<T>(p.dest, y, p.offset);
+        if (direct) {
+            apply_taps<A, Sym>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+        } else {
+            apply_taps<A, Sym>(s.out, s.src, p.ntaps, n, s);
+            store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
+        }
+    }
+}
+
+template <class T, class A, bool Sym, bool AlongY>
+PLX_INLINE void run_pass(const Pass &p, const Scratch<A> &s)
+{
+    if constexpr (AlongY)
+        pass_y<T, A, Sym>(p, s);
+    else
+        pass_x<T, A, Sym>(p, s);
+}
+
+template <class T, class A, bool Sym, bool AlongY>
+void run_pass_baseline(const Pass &p, const Scratch<A> &s)
+{
+    run_pass<T, A, Sym, AlongY>(p, s);
+}
+
+#ifdef PLX_X86
+template <class T, class A, bool Sym, bool AlongY>
+[[gnu::target("avx2,fma")]] void run_pass_avx2(const Pass &p, const Scratch<A> &s)
+{
+    run_pass<T, A, Sym, AlongY>(p, s);
+}
+
+bool cpu_has_avx2_fma()
+{
+    static const bool has = __builtin_cpu_supports("avx2") && __builtin_cpu_supports("fma");
+    return has;
+}
+#endif
+
+template <class T, class A, bool Sym, bool AlongY>
+void dispatch_pass(const Pass &p, const Scratch<A> &s)
+{
+#ifdef PLX_X86
+    if (cpu_has_avx2_fma()) {
+        run_pass_avx2<T, A, Sym, AlongY>(p, s);
+        return;
+    }
+#endif
+    run_pass_baseline<T, A, Sym, AlongY>(p, s);
+}
+
+// ---- scratch and the typed entry ----
+
+// Bytes of n objects of T rounded up to a cache line, so every piece stays aligned.
+template <class T>
+std::size_t piece(std::size_t n)
+{
+    return (n * sizeof(T) + 63) / 64 * 64;
+}
+
+double tap(const Plx_Mask1D *mask, uint32_t t)
+{
+    return mask->type == PLX_TYPE_FLOAT ? double(static_cast<const float *>(mask->data)[t])
+                                        : static_cast<const double *>(mask->data)[t];
+}
+
+template <class A>
+void mask_values(const Plx_Mask1D *mask, A *k)
+{
+    for (uint32_t t = 0; t < mask->size; ++t) {
+        if constexpr (std::is_same_v<A, uint16_t>)
+            k[t] = static_cast<A>(std::lround(tap(mask, t) * 131072.0));
+        else if (mask->type == PLX_TYPE_FLOAT)
+            k[t] = static_cast<A>(static_cast<const float *>(mask->data)[t]);
+        else
+            k[t] = static_cast<A>(static_cast<const double *>(mask->data)[t]);
+    }
+}
+
+// True when 16-bit fixed point suits the mask: symmetric, every tap in [0, 0.5) so that it
+// fits 17 fractional bits, and a sum small enough that no sum of products can overflow.
+bool fixed_point_suits(const Plx_Mask1D *mask)
+{
+    double sum = 0;
+    for (uint32_t t = 0; t < mask->size; ++t) {
+        const double v = tap(mask, t);
+        if (!(v >= 0) || std::lround(v * 131072.0) > 65535 || v != tap(mask, mask->size - 1 - t)) return false;
+        sum += v;
+    }
+    return sum <= 1.003;
+}
+
+template <class T, class A, bool AlongY>
+bool convolve_typed(Pass &p, const Plx_Mask1D *mask, const char *function)
+{
+    constexpr std::size_t W = Lanes<A>::W;
+    const std::size_t ntaps = p.ntaps, r = ntaps / 2;
+    const std::size_t w = std::size_t(p.source->width), h = std::size_t(p.source->height);
+    const std::size_t n = w * p.lanes;
+    const uint32_t ring_rows = AlongY ? uint32_t(std::min<std::size_t>(ntaps, h)) : 0;
+
+    const std::size_t sizes[] = {
+        piece<A>(ntaps),
+        AlongY ? 0 : piece<A>((w + 2 * r) * p.lanes),
+        piece<A>(n),
+        piece<A>((ntaps + 1) * W),
+        piece<const A *>(ntaps),
+        piece<const A *>(ntaps),
+        AlongY ? piece<A>(std::size_t(ring_rows) * n) : 0,
+        piece<int64_t>(ring_rows),
+        AlongY ? piece<A>(n) : 0,
+    };
+    std::size_t total = 0;
+    for (std::size_t z : sizes) total += z;
+    plx::HeapPtr<unsigned char> block(static_cast<unsigned char *>(std::aligned_alloc(64, total)));
+    if (!block) {
+        PLX_ERR_START_AS(function, PLX_ERROR_MALLOC_FAILED, "", static_cast<int64_t>(total));
+        return false;
+    }
+    unsigned char *at = block.get();
+    auto take = [&at](std::size_t bytes) {
+        unsigned char *q = at;
+        at += bytes;
+        return q;
+    };
+    Scratch<A> s;
+    s.k = reinterpret_cast<A *>(take(sizes[0]));
+    s.line = reinterpret_cast<A *>(take(sizes[1]));
+    s.out = reinterpret_cast<A *>(take(sizes[2]));
+    s.stage = reinterpret_cast<A *>(take(sizes[3]));
+    s.src = reinterpret_cast<const A **>(take(sizes[4]));
+    s.stage_src = reinterpret_cast<const A **>(take(sizes[5]));
+    s.ring = reinterpret_cast<A *>(take(sizes[6]));
+    s.ring_row = reinterpret_cast<int64_t *>(take(sizes[7]));
+    s.zero = reinterpret_cast<A *>(take(sizes[8]));
+    s.ring_rows = ring_rows;
+    if (AlongY) std::fill(s.zero, s.zero + n, A(0));
+    mask_values(mask, s.k);
+
+#ifdef PLX_X86
+    if constexpr (std::is_same_v<A, uint16_t>) {
+        run_pass_avx2<T, A, true, AlongY>(p, s);  // chosen only on such machines
+        return true;
+    }
+#endif
+    bool symmetric = true;
+    for (std::size_t t = 0; t < r; ++t) symmetric = symmetric && s.k[t] == s.k[ntaps - 1 - t];
+    if (symmetric)
+        dispatch_pass<T, A, true, AlongY>(p, s);
+    else
+        dispatch_pass<T, A, false, AlongY>(p, s);
+    return true;
+}
+
+// Byte span [lo, hi) covered by an image's rows.
+void pixel_span(const Plx_Image *im, uintptr_t *lo, uintptr_t *hi)
+{
+    const uintptr_t base = reinterpret_cast<uintptr_t>(im->data);
+    const intptr_t last = static_cast<intptr_t>(im->height - 1) * im->stride;
+    const uintptr_t row = static_cast<uintptr_t>(im->width) * plx_image_format_channels(im->format) *
+                          plx_image_type_size(im->type);
+    *lo = last < 0 ? base + last : base;
+    *hi = (last < 0 ? base : base + last) + row;
+}
+
+bool check_convolution(const Plx_Image *source, int32_t channel, Plx_EdgeBehaviour edge,
+                       const Plx_Mask1D *mask, const Plx_Image *dest, const char *function)
+{
+    if (source == nullptr || dest == nullptr || mask == nullptr) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT,
+                         source == nullptr ? "null source" : dest == nullptr ? "null dest" : "null mask", 0);
+        return false;
+    }
+    if (mask->type != PLX_TYPE_FLOAT && mask->type != PLX_TYPE_DOUBLE) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_PIXEL_TYPE, "mask must be float or double", mask->type);
+        return false;
+    }
+    if (mask->size % 2 == 0 || mask->data == nullptr) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT, "mask needs an odd size and values", mask->size);
+        return false;
+    }
+    if (edge != PLX_EDGE_ZERO && edge != PLX_EDGE_EXTEND && edge != PLX_EDGE_REFLECT) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_TYPE, "unknown edge behaviour", edge);
+        return false;
+    }
+    if (!plx::check_format_type(source->format, source->type, function)) return false;
+    if (source->format == PLX_FORMAT_POINTER) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_FORMAT, "pointer images cannot be convolved", source->format);
+        return false;
+    }
+    if (source->type == PLX_TYPE_BIT) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_PIXEL_TYPE, "bit images cannot be convolved", source->type);
+        return false;
+    }
+    if (dest->format != source->format || dest->type != source->type ||
+        dest->width != source->width || dest->height != source->height) {
+        PLX_ERR_START_AS(function, PLX_ERROR_INCOMPATIBLE, "source and dest differ in format, type or size", 0);
+        return false;
+    }
+    if (channel >= static_cast<int32_t>(plx_image_format_channels(source->format))) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT, "no such channel", channel);
+        return false;
+    }
+    if (source->width < 0 || source->height < 0) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT, "negative image size", 0);
+        return false;
+    }
+    if (source->width == 0 || source->height == 0) return true;
+    if (source->data == nullptr || dest->data == nullptr) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT, "image without pixels", 0);
+        return false;
+    }
+    uintptr_t slo, shi, dlo, dhi;
+    pixel_span(source, &slo, &shi);
+    pixel_span(dest, &dlo, &dhi);
+    if (slo < dhi && dlo < shi) {
+        PLX_ERR_START_AS(function, PLX_ERROR_INCOMPATIBLE, "source and dest share pixels", 0);
+        return false;
+    }
+    return true;
+}
+
+template <bool AlongY>
+Plx_Bool convolve(const Plx_Image *source, int32_t channel, Plx_EdgeBehaviour edge,
+                  const Plx_Mask1D *mask, Plx_Image *dest, const char *function)
+{
+    if (!check_convolution(source, channel, edge, mask, dest, function)) return 0;
+    if (source->width == 0 || source->height == 0) return 1;
+    const std::size_t step = plx_image_format_channels(source->format);
+    const bool one = channel >= 0 && step > 1;
+    Pass p{source, dest, mask->size, step, one ? 1 : step, one ? std::size_t(channel) : 0, edge};
+    bool ok = true;
+    plx::dispatch_numeric_type(source->type, [&](auto tag) {
+        using T = decltype(tag);
+#ifdef PLX_X86
+        if constexpr (std::is_same_v<T, uint8_t>) {
+            if (cpu_has_avx2_fma() && fixed_point_suits(mask)) {
+                ok = convolve_typed<T, uint16_t, AlongY>(p, mask, function);
+                return;
+            }
+        }
+#endif
+        ok = convolve_typed<T, typename plx::PixelTraits<T>::Accum, AlongY>(p, mask, function);
+    });
+    return ok ? 1 : 0;
+}
+
+}  // namespace
+
+extern "C" {
+
+PLX_API Plx_Mask1D *plx_gauss_mask_new(Plx_PixelType type, double sigma, uint32_t size, double scale)
+{
+    if (type != PLX_TYPE_FLOAT && type != PLX_TYPE_DOUBLE) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_PIXEL_TYPE, "mask must be float or double", type);
+        return nullptr;
+    }
+    if (!(sigma > 0) || size % 2 == 0 || !std::isfinite(scale)) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "needs sigma > 0, an odd size and a finite scale", size);
+        return nullptr;
+    }
+    plx::HeapPtr<Plx_Mask1D> mask(PLX_ALLOC(Plx_Mask1D, 1));
+    if (!mask) return nullptr;
+    const std::size_t bytes = std::size_t(size) * plx_image_type_size(type);
+    void *data = PLX_ALLOC(unsigned char, bytes);
+    if (data == nullptr) return nullptr;
+    const int64_t r = size / 2;
+    const double denom = 2.0 * sigma * sigma;
+    double sum = 0;
+    for (int64_t i = -r; i <= r; ++i) sum += std::exp(-double(i * i) / denom);
+    const double norm = scale / sum;
+    for (int64_t i = -r; i <= r; ++i) {
+        const double v = std::exp(-double(i * i) / denom) * norm;
+        if (type == PLX_TYPE_FLOAT)
+            static_cast<float *>(data)[i + r] = static_cast<float>(v);
+        else
+            static_cast<double *>(data)[i + r] = v;
+    }
+    mask->type = type;
+    mask->size = size;
+    mask->data = data;
+    return mask.release();
+}
+
+PLX_API void plx_mask1D_free(Plx_Mask1D *mask)
+{
+    if (mask == nullptr) return;
+    std::free(mask->data);
+    std::free(mask);
+}
+
+PLX_API Plx_Bool plx_image_convolve1Dx_q(const Plx_Image *source, int32_t channel,
+                                         Plx_EdgeBehaviour edge, const Plx_Mask1D *mask,
+                                         Plx_Image *dest)
+{
+    return convolve<false>(source, channel, edge, mask, dest, __func__);
+}
+
+PLX_API Plx_Bool plx_image_convolve1Dy_q(const Plx_Image *source, int32_t channel,
+                                         Plx_EdgeBehaviour edge, const Plx_Mask1D *mask,
+                                         Plx_Image *dest)
+{
+    return convolve<true>(source, channel, edge, mask, dest, __func__);
+}
+
+}  // extern "C"

@@ -1,0 +1,283 @@
+// Evaluating one observation: its prediction, Jacobians (from the function or by central
+// differences), effective information matrix, robust decision, cost, and its contribution
+// to the information blocks.
+#include <cfloat>
+#include <cmath>
+
+#include "sumo/sumo_internal.hpp"
+
+using namespace sumo;
+
+namespace {
+
+bool is_h(const SumoObs *o) { return o->kind == SUMO_OBS_H || o->kind == SUMO_OBS_H_ROBUST; }
+bool is_robust(const SumoObs *o) { return o->kind == SUMO_OBS_H_ROBUST || o->kind == SUMO_OBS_F_ROBUST; }
+
+bool call_function(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, Plx_Vector *out, Plx_Matrix **jac, Plx_Matrix *Fz)
+{
+    const uint32_t m = o->z.v.rows;
+    if (!plx_vec_resize(out, m)) return false;
+    if (is_h(o)) return o->func.h(sumo, ws, o->states, o->n_states, &o->z, out, jac) != 0;
+    if (Fz != nullptr && !plx_mat_resize(Fz, m, m)) return false;
+    return o->func.F(sumo, ws, o->states, o->n_states, &o->z, out, jac, Fz) != 0;
+}
+
+// Central differences of the wanted Jacobians; the function is called without Jacobians.
+// The steps are taken on a private copy of the state (the observation's slot points at it
+// meanwhile): other jobs may be evaluating observations of the same state at the same time,
+// so the shared parameters are never written.
+bool numeric_jacobians(Sumo *sumo, SumoWorkspace *ws, SumoObs *o)
+{
+    for (uint32_t i = 0; i < o->n_states; ++i) {
+        Plx_Matrix *J = ws->jacobian_ptrs[i];
+        if (J == nullptr) continue;
+        SumoStateVector *s = o->states[i];
+        const uint32_t n = dim(s);
+        const double d = s->jacobian_step;
+        if (!plx_mat_resize(&ws->mat, 1, n)) return false;
+        SumoStateVector shadow = *s;
+        shadow.x.v.data = ws->mat.data;
+        std::memcpy(shadow.x.v.data, s->x.v.data, sizeof(double) * n);
+        o->states[i] = &shadow;
+        bool ok = true;
+        for (uint32_t k = 0; ok && k < n; ++k) {
+            double &xk = shadow.x.v.data[k];
+            const double saved = xk;
+            xk = saved - d;
+            ok = call_function(sumo, ws, o, &ws->vec, nullptr, nullptr);
+            xk = saved + d;
+            ok = ok && call_function(sumo, ws, o, &ws->h, nullptr, nullptr);
+            xk = saved;
+            if (!ok) break;
+            const uint32_t rows = ws->h.rows;
+            if (ws->vec.rows != rows) {
+                PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_INCOMPATIBLE, "function output size changed", rows);
+                ok = false;
+                break;
+            }
+            if (k == 0 && !plx_mat_resize(J, rows, n)) {
+                ok = false;
+                break;
+            }
+            const double inv = 1.0 / (2.0 * d);
+            for (uint32_t r = 0; r < rows; ++r)
+                J->data[std::size_t(r) * n + k] = (ws->h.data[r] - ws->vec.data[r]) * inv;
+        }
+        o->states[i] = s;
+        if (!ok) return false;
+    }
+    return true;
+}
+
+// The effective information N' of an F-type: (Fz N Fz^T)^-1.
+bool f_information(SumoWorkspace *ws, const SumoObs *o, uint32_t k)
+{
+    const uint32_t m = o->z.v.rows;
+    if (ws->Fz.rows != k || ws->Fz.cols != m) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_INCOMPATIBLE, "dF/dz has the wrong size", ws->Fz.rows);
+        return false;
+    }
+    if (!plx_squmat_resize(&ws->squ, PLX_SQUMAT_GENERIC, m) || !plx_mat_resize(&ws->mat, k, m) ||
+        !plx_squmat_resize(&ws->N_eff, PLX_SQUMAT_SYMMETRIC, k))
+        return false;
+    squ_dense(&o->N, ws->squ.data);
+    std::memset(ws->mat.data, 0, sizeof(double) * k * m);
+    add_ab(1.0, ws->Fz.data, ws->squ.data, k, m, m, ws->mat.data);
+    std::memset(ws->N_eff.data, 0, sizeof(double) * k * k);
+    add_abt(1.0, ws->mat.data, ws->Fz.data, k, m, k, ws->N_eff.data);
+    if (!chol(ws->N_eff.data, k)) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_ILLEGAL_ARGUMENT, "Fz N Fz^T is not positive definite", 0);
+        return false;
+    }
+    if (!plx_squmat_resize(&ws->squ, PLX_SQUMAT_SYMMETRIC, k)) return false;
+    chol_inverse(ws->N_eff.data, k, ws->squ.data);
+    std::memcpy(ws->N_eff.data, ws->squ.data, sizeof(double) * k * k);
+    return true;
+}
+
+double quad(const double *N, const double *r, uint32_t k)
+{
+    double q = 0.0;
+    for (uint32_t i = 0; i < k; ++i) {
+        double s = 0.0;
+        for (uint32_t j = 0; j < k; ++j) s += N[std::size_t(i) * k + j] * r[j];
+        q += r[i] * s;
+    }
+    return q;
+}
+
+}  // namespace
+
+namespace sumo {
+
+// Evaluates the observation into the workspace: jacobian_ptrs (null when unwanted), h,
+// residual (when asked), N_eff and chi-squared. With `decide`, robust kinds take a new
+// decision from chi-squared; otherwise the stored decision applies. N_eff is scaled for
+// outliers. Jacobians are wanted for active states of nonzero dimension whose index lies in
+// [first, last] (first kAll: all) when `jacobians` is set.
+bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool decide, bool jacobians,
+                  uint32_t first, uint32_t last, double *chi2)
+{
+    if (o->kind > SUMO_OBS_F_ROBUST) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_ILLEGAL_TYPE, "unknown observation kind", o->kind);
+        return false;
+    }
+    if (!workspace_grow(ws, o->n_states)) return false;
+    const uint32_t m = o->z.v.rows;
+    bool any = false;
+    for (uint32_t i = 0; i < o->n_states; ++i) {
+        SumoStateVector *s = o->states[i];
+        const bool want = jacobians && s != nullptr && is_active(s) && dim(s) > 0 &&
+                          (first == kAll || (s->index >= first && s->index <= last));
+        ws->jacobian_ptrs[i] = want ? &ws->jacobians[i] : nullptr;
+        if (want) {
+            any = true;
+            if (!plx_mat_resize(&ws->jacobians[i], m, dim(s))) return false;
+            std::memset(ws->jacobians[i].data, 0, sizeof(double) * m * dim(s));
+        }
+    }
+    const bool numeric = any && o->numeric_jacobians;
+    if (numeric && !numeric_jacobians(sumo, ws, o)) return false;
+    Plx_Matrix **jac = (any && !numeric) ? ws->jacobian_ptrs : nullptr;
+    if (!call_function(sumo, ws, o, &ws->h, jac, is_h(o) ? nullptr : &ws->Fz)) return false;
+    const uint32_t k = ws->h.rows;
+    if (is_h(o) && k != m) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_INCOMPATIBLE, "h has the wrong size", k);
+        return false;
+    }
+    for (uint32_t i = 0; i < o->n_states; ++i) {
+        const Plx_Matrix *J = ws->jacobian_ptrs[i];
+        if (J != nullptr && (J->rows != k || J->cols != dim(o->states[i]))) {
+            PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_INCOMPATIBLE, "Jacobian has the wrong size", J->rows);
+            return false;
+        }
+    }
+    if (is_h(o)) {
+        if (!plx_squmat_resize(&ws->N_eff, PLX_SQUMAT_SYMMETRIC, k)) return false;
+        squ_dense(&o->N, ws->N_eff.data);
+    } else if (!f_information(ws, o, k)) {
+        return false;
+    }
+    *chi2 = 0.0;
+    if (residual) {
+        if (!plx_vec_resize(&ws->residual, k)) return false;
+        for (uint32_t r = 0; r < k; ++r)
+            ws->residual.data[r] = is_h(o) ? o->z.v.data[r] - ws->h.data[r] : -ws->h.data[r];
+        *chi2 = quad(ws->N_eff.data, ws->residual.data, k);
+        if (!std::isfinite(*chi2)) {
+            PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_OUTSIDE_RANGE, "residual is not finite", 0);
+            return false;
+        }
+        if (decide && is_robust(o)) o->outlier = *chi2 > o->chi2_cutoff ? 1u : 0u;
+    }
+    if (is_robust(o) && o->outlier) {
+        const double inv = 1.0 / o->variance_scaling;
+        for (std::size_t i = 0; i < std::size_t(k) * k; ++i) ws->N_eff.data[i] *= inv;
+    }
+    return true;
+}
+
+double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, const char *function)
+{
+    double chi2;
+    if (!evaluate_obs(sumo, ws, o, true, false, false, kAll, kAll, &chi2)) {
+        plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+        return SUMO_FAILED_RESIDUAL;
+    }
+    // chi2 is always r^T N' r with the unscaled N'.
+    if (!is_robust(o)) return chi2 * o->weight;
+    if (chi2 <= o->chi2_cutoff) {
+        o->outlier = 0;
+        return chi2 * o->weight;
+    }
+    o->outlier = 1;
+    return (chi2 / o->variance_scaling + o->chi2_offset) * o->weight;
+}
+
+}  // namespace sumo
+
+extern "C" {
+
+PLANO_API Plx_Bool bSumoObsEvaluate(Sumo *sumo, SumoWorkspace *workspace, SumoObs *obs, uint32_t residual,
+                                    uint32_t eliminate, uint32_t add, uint32_t first, uint32_t last, uint32_t thread)
+{
+    if (sumo == nullptr || workspace == nullptr || obs == nullptr) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
+        return PLX_FALSE;
+    }
+    if (thread != SUMO_NOT_IN_THREAD && thread >= sumo->n_threads) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "thread index beyond the thread count", thread);
+        return PLX_FALSE;
+    }
+    if (thread == SUMO_NOT_IN_THREAD && !ensure_indices(sumo)) return PLX_FALSE;
+    double chi2;
+    if (!evaluate_obs(sumo, workspace, obs, residual != 0, residual != 0, true, first, last, &chi2)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    SumoWorkspace *ws = workspace;
+    const uint32_t k = ws->h.rows;
+    const double alpha = (add ? 1.0 : -1.0) * obs->weight;
+    // N' J_i for every state with a Jacobian.
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        const Plx_Matrix *J = ws->jacobian_ptrs[i];
+        if (J == nullptr) continue;
+        if (!plx_mat_resize(&ws->nj[i], k, J->cols)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        std::memset(ws->nj[i].data, 0, sizeof(double) * k * J->cols);
+        add_ab(1.0, ws->N_eff.data, J->data, k, k, J->cols, ws->nj[i].data);
+    }
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        const Plx_Matrix *Ji = ws->jacobian_ptrs[i];
+        if (Ji == nullptr) continue;
+        SumoStateVector *s = obs->states[i];
+        const uint32_t n = Ji->cols;
+        double *A, *b;
+        if (eliminate) {
+            A = s->A.data;
+            b = s->b.data;
+        } else if (thread != SUMO_NOT_IN_THREAD) {
+            A = s->thread_blocks[thread].A.data;
+            b = s->thread_blocks[thread].b.data;
+        } else {
+            A = s->A_work.data;
+            b = s->b_work.data;
+        }
+        add_atb(alpha, Ji->data, ws->nj[i].data, k, n, n, A);
+        if (residual) add_atv(alpha, ws->nj[i].data, ws->residual.data, k, n, b);
+        for (uint32_t j = i + 1; j < obs->n_states; ++j) {
+            const Plx_Matrix *Jj = ws->jacobian_ptrs[j];
+            if (Jj == nullptr) continue;
+            SumoOffdiag *blk;
+            bool i_row;
+            if (!block_between(sumo, s, obs->states[j], thread == SUMO_NOT_IN_THREAD, &blk, &i_row)) {
+                PLX_ERR_PASS();
+                return PLX_FALSE;
+            }
+            if (blk == nullptr) {
+                PLX_ERR_START(PLX_ERROR_NOT_INITIALISED, "off-diagonal block not made before a threaded build", 0);
+                return PLX_FALSE;
+            }
+            double *M = eliminate ? blk->M.data
+                                  : (thread != SUMO_NOT_IN_THREAD ? blk->thread_blocks[thread].data : blk->M_work.data);
+            if (i_row)
+                add_atb(alpha, Ji->data, ws->nj[j].data, k, n, Jj->cols, M);
+            else
+                add_atb(alpha, Jj->data, ws->nj[i].data, k, Jj->cols, n, M);
+        }
+    }
+    return PLX_TRUE;
+}
+
+PLANO_API double dSumoObsComputeResidual(Sumo *sumo, SumoWorkspace *workspace, SumoObs *obs)
+{
+    if (sumo == nullptr || workspace == nullptr || obs == nullptr) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
+        return SUMO_FAILED_RESIDUAL;
+    }
+    return obs_cost(sumo, workspace, obs, __func__);
+}
+
+}  // extern "C"

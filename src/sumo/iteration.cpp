@@ -1,0 +1,192 @@
+// One Levenberg-Marquardt (or Gauss-Newton) iteration on a branch or a run of states.
+#include <algorithm>
+
+#include "sumo/sumo_internal.hpp"
+
+using namespace sumo;
+
+namespace {
+
+bool failed_cost(double c) { return c == SUMO_FAILED_RESIDUAL; }
+
+}  // namespace
+
+extern "C" {
+
+PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch, SumoStateVector *target,
+                                                  uint32_t apply, double lambda, uint32_t mode, uint32_t first,
+                                                  uint32_t last, uint32_t *accepted, double *reduction,
+                                                  const ThreadHostInterface *host)
+{
+    if (sumo == nullptr || branch == nullptr) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
+        return PLX_FALSE;
+    }
+    if (accepted != nullptr) *accepted = 0;
+    if (reduction != nullptr) *reduction = 0.0;
+    if (!ensure_indices(sumo)) return PLX_FALSE;
+    Scope scope;
+    scope.branch = branch;
+    if (!store_scope(scope, host)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (accepted == nullptr) {
+        sumo->residual = 0.0;
+        sumo->modified = 1;
+        sumo->cache_first = sumo->cache_last = nullptr;
+        sumo->cache_branch = nullptr;
+    } else if (sumo->modified || sumo->cache_branch != branch) {
+        const double c = residual_scope(sumo, scope, host, __func__);
+        if (failed_cost(c)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        sumo->residual = c;
+        sumo->modified = 0;
+        sumo->cache_branch = branch;
+        sumo->cache_first = sumo->cache_last = nullptr;
+    }
+    if (!build_scope(sumo, scope, apply, first, last, host, __func__)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (lambda != 0.0 && !bDampInformationMatrixBranch(branch, lambda, mode)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    int32_t code = 0;
+    if (!eliminate_scope(scope, sumo, apply, last, &code, __func__)) {
+        if (code == 0) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        return PLX_TRUE;  // not positive definite: the step is rejected, parameters untouched
+    }
+    sumo->covariance_done = 0;
+    init_elim_state_covariance(sumo, target, apply == 0);
+    if (!back_substitute_scope(sumo, scope, target, apply, first, last)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (!apply) {
+        if (target != nullptr && target->status == SUMO_STATE_ELIMINATED &&
+            !compute_elim_state_covariance(sumo, target)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        sumo->covariance_done = 1;
+        return PLX_TRUE;
+    }
+    if (!increment_scope(sumo, scope, first, last)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    const double c1 = (accepted != nullptr || reduction != nullptr) ? residual_scope(sumo, scope, host, __func__) : 0.0;
+    if (failed_cost(c1)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (accepted != nullptr && c1 >= sumo->residual) {
+        if (!reinstate_scope(sumo, scope)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        return PLX_TRUE;
+    }
+    if (!adjust_eliminated_states_in(sumo, first, last) ||
+        !adjust_info_vector_scope(scope, first == kAll ? 0 : first, last)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (reduction != nullptr) *reduction = sumo->residual - c1;
+    if (accepted != nullptr) {
+        sumo->residual = c1;
+        *accepted = 1;
+    }
+    return PLX_TRUE;
+}
+
+PLANO_API Plx_Bool bSumoLevMarqIterationStateRange(Sumo *sumo, SumoStateVector *first_state,
+                                                   SumoStateVector *last_state, double lambda, uint32_t mode,
+                                                   uint32_t first, uint32_t last, uint32_t *accepted,
+                                                   double *reduction, const ThreadHostInterface *host)
+{
+    if (sumo == nullptr) {
+        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
+        return PLX_FALSE;
+    }
+    if (accepted != nullptr) *accepted = 0;
+    if (reduction != nullptr) *reduction = 0.0;
+    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
+    Scope scope;
+    scope.first = first_state;
+    scope.last = last_state;
+    if (!build_scope(sumo, scope, 1, first, last, host, __func__)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (accepted != nullptr) {
+        if (sumo->modified || sumo->cache_first != first_state || sumo->cache_last != last_state ||
+            sumo->cache_branch != nullptr) {
+            const double c = residual_scope(sumo, scope, host, __func__);
+            if (failed_cost(c)) {
+                PLX_ERR_PASS();
+                return PLX_FALSE;
+            }
+            sumo->residual = c;
+            sumo->modified = 0;
+            sumo->cache_first = first_state;
+            sumo->cache_last = last_state;
+            sumo->cache_branch = nullptr;
+        }
+        if (!store_scope(scope, host)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+    }
+    if (lambda != 0.0 && !bDampInformationMatrixStateRange(first_state, last_state, lambda, mode)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    int32_t code = 0;
+    if (!eliminate_scope(scope, sumo, 1, last, &code, __func__)) {
+        if (code == 0) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        return PLX_TRUE;
+    }
+    if (!back_substitute_scope(sumo, scope, nullptr, 1, first, last) || !increment_scope(sumo, scope, first, last)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    const double c1 = residual_scope(sumo, scope, host, __func__);
+    if (failed_cost(c1)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (accepted != nullptr && c1 >= sumo->residual) {
+        if (!reinstate_scope(sumo, scope)) {
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        return PLX_TRUE;
+    }
+    uint32_t lo = kAll, hi = kAll;
+    bSumoGetIndexLimitsStateRange(first_state, last_state, &lo, &hi);
+    if (first != kAll) {
+        lo = std::max(lo, first);
+        hi = std::min(hi, last);
+    }
+    if (!adjust_info_vector_scope(scope, lo, hi)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    if (reduction != nullptr) *reduction = sumo->residual - c1;
+    sumo->residual = c1;
+    if (accepted != nullptr) *accepted = 1;
+    return PLX_TRUE;
+}
+
+}  // extern "C"

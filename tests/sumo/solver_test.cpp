@@ -1,0 +1,590 @@
+// The solver against closed forms and against a dense Gauss-Newton reference.
+#include <random>
+
+#include "sumo_test_util.hpp"
+
+using namespace sumo_test;
+
+namespace {
+
+constexpr uint32_t kAll = 0xFFFFFFFFu;
+
+// ---- a straight line y = a x + b, one observation per point, x in the observation's data ----
+
+Plx_Bool h_line(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t, const SumoVector *z, Plx_Vector *h,
+                Plx_Matrix **J)
+{
+    const double x = *static_cast<const double *>(z->user_data);
+    h->data[0] = s[0]->x.v.data[0] * x + s[0]->x.v.data[1];
+    if (J != nullptr && J[0] != nullptr) {
+        J[0]->data[0] = x;
+        J[0]->data[1] = 1.0;
+    }
+    return PLX_TRUE;
+}
+
+struct LineFit {
+    SumoPtr sumo;
+    SumoStateVector *line;
+    std::vector<double> xs, ys;
+    double sigma = 0.5;
+
+    explicit LineFit(bool numeric, const ThreadHostInterface *host = nullptr) : sumo(pSumoForm(nullptr, host))
+    {
+        line = pSumoStateVectorNew(sumo.get(), sumo->root, 2, nullptr, nullptr);
+        Vec x0{0.3, -1.0};
+        EXPECT_TRUE(bSumoStateVectorInit(sumo.get(), line, &x0.v));
+        std::mt19937 rng(7);
+        std::normal_distribution<double> noise(0.0, sigma);
+        for (int i = 0; i < 12; ++i) {
+            xs.push_back(i * 0.7 - 3.0);
+            ys.push_back(1.7 * xs.back() + 0.4 + noise(rng));
+        }
+        for (int i = 0; i < 12; ++i) {
+            Vec z{ys[i]};
+            Squ Ni(1, 1.0 / (sigma * sigma));
+            SumoObs *o = pSumoObsH_va(sumo.get(), &z.v, &Ni.m, h_line, nullptr, line, nullptr);
+            EXPECT_NE(o, nullptr);
+            o->z.user_data = &xs[i];
+            o->numeric_jacobians = numeric ? 1u : 0u;
+        }
+    }
+    // Ordinary least squares by the textbook formulas.
+    void closed_form(double &a, double &b, Eigen::Matrix2d &cov) const
+    {
+        const double n = double(xs.size());
+        double sx = 0, sy = 0, sxx = 0, sxy = 0;
+        for (size_t i = 0; i < xs.size(); ++i) {
+            sx += xs[i];
+            sy += ys[i];
+            sxx += xs[i] * xs[i];
+            sxy += xs[i] * ys[i];
+        }
+        a = (n * sxy - sx * sy) / (n * sxx - sx * sx);
+        b = (sy - a * sx) / n;
+        const double det = n * sxx - sx * sx;
+        cov << n / det, -sx / det, -sx / det, sxx / det;
+        cov *= sigma * sigma;
+    }
+};
+
+TEST(SumoSolver, StraightLineMatchesClosedForm)
+{
+    double a, b;
+    Eigen::Matrix2d cov;
+    {
+        LineFit fit(false);
+        fit.closed_form(a, b, cov);
+        // Gauss-Newton: one step solves a linear problem.
+        ASSERT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
+                                                   nullptr, nullptr, nullptr));
+        EXPECT_NEAR(fit.line->x.v.data[0], a, 1e-12);
+        EXPECT_NEAR(fit.line->x.v.data[1], b, 1e-12);
+        // Covariance mode leaves the parameters and gives the inverse information.
+        ASSERT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 0, 0.0, 0, kAll, kAll,
+                                                   nullptr, nullptr, nullptr));
+        EXPECT_EQ(fit.sumo->covariance_done, 1u);
+        EXPECT_EQ(fit.line->covariance_valid, 1u);
+        EXPECT_NEAR(fit.line->x.v.data[0], a, 1e-12);
+        EXPECT_TRUE(dense(*pgsmSumoGetCovmatDiag(fit.line)).isApprox(cov, 1e-12));
+    }
+    {
+        // Levenberg-Marquardt with damping converges to the same line and reports its gains.
+        LineFit fit(false);
+        const double c0 = dSumoComputeResidual(fit.sumo.get(), 0, nullptr);
+        double lambda = 1.0, total = 0.0;
+        for (int it = 0; it < 40; ++it) {
+            uint32_t accepted = 7;
+            double reduction = -1.0;
+            ASSERT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, lambda, 0, kAll,
+                                                       kAll, &accepted, &reduction, nullptr));
+            if (accepted) {
+                EXPECT_GT(reduction, 0.0);
+                total += reduction;
+                lambda *= 0.1;
+            } else {
+                EXPECT_EQ(reduction, 0.0);
+                lambda *= 10.0;
+            }
+        }
+        EXPECT_NEAR(fit.line->x.v.data[0], a, 1e-9);
+        EXPECT_NEAR(fit.line->x.v.data[1], b, 1e-9);
+        EXPECT_NEAR(c0 - total, dSumoComputeResidual(fit.sumo.get(), 0, nullptr), 1e-9);
+        EXPECT_NEAR(fit.sumo->residual, c0 - total, 1e-9);
+    }
+    {
+        // More jobs than observations: the empty chunks complete at once.
+        HostPtr host(plano_host_new(16));
+        LineFit fit(false, plano_host_interface(host.get()));
+        EXPECT_EQ(fit.sumo->n_threads, 16u);
+        ASSERT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
+                                                   nullptr, nullptr, plano_host_interface(host.get())));
+        EXPECT_NEAR(fit.line->x.v.data[0], a, 1e-12);
+        EXPECT_NEAR(fit.line->x.v.data[1], b, 1e-12);
+        vThreadedWorkerPoolFree();
+    }
+    {
+        // Central differences reach the same answer.
+        LineFit fit(true);
+        ASSERT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
+                                                   nullptr, nullptr, nullptr));
+        EXPECT_NEAR(fit.line->x.v.data[0], a, 1e-7);
+        EXPECT_NEAR(fit.line->x.v.data[1], b, 1e-7);
+    }
+}
+
+// The same line as an F-type: z = (x, y) with covariance diag(0, sigma^2) and
+// F = y - a x - b, a single equation (F is resized to 1).
+Plx_Bool f_line(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t, const SumoVector *z, Plx_Vector *F,
+                Plx_Matrix **J, Plx_Matrix *Fz)
+{
+    const double a = s[0]->x.v.data[0], b = s[0]->x.v.data[1];
+    if (!plx_vec_resize(F, 1)) return PLX_FALSE;
+    F->data[0] = z->v.data[1] - a * z->v.data[0] - b;
+    if (J != nullptr && J[0] != nullptr) {
+        if (!plx_mat_resize(J[0], 1, 2)) return PLX_FALSE;
+        J[0]->data[0] = -z->v.data[0];
+        J[0]->data[1] = -1.0;
+    }
+    if (Fz != nullptr) {
+        if (!plx_mat_resize(Fz, 1, 2)) return PLX_FALSE;
+        Fz->data[0] = -a;
+        Fz->data[1] = 1.0;
+    }
+    return PLX_TRUE;
+}
+
+TEST(SumoSolver, FTypeLineAndRobustOutlier)
+{
+    LineFit reference(false);
+    double a, b;
+    Eigen::Matrix2d cov;
+    reference.closed_form(a, b, cov);
+    for (bool numeric : {false, true}) {
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *line = pSumoStateVectorNew(sumo.get(), sumo->root, 2, nullptr, nullptr);
+        Vec x0{0.3, -1.0};
+        ASSERT_TRUE(bSumoStateVectorInit(sumo.get(), line, &x0.v));
+        Eigen::Matrix2d N = Eigen::Vector2d(0.0, reference.sigma * reference.sigma).asDiagonal();
+        Squ Nm(N);
+        for (size_t i = 0; i < reference.xs.size(); ++i) {
+            Vec z{reference.xs[i], reference.ys[i]};
+            SumoObs *o = pSumoObsF_va(sumo.get(), &z.v, &Nm.m, f_line, nullptr, line, nullptr);
+            ASSERT_NE(o, nullptr);
+            o->numeric_jacobians = numeric ? 1u : 0u;
+        }
+        // A gross outlier, robust: after the first decisions it counts for little.
+        Vec zo{1.0, 40.0};
+        ASSERT_NE(pSumoObsFRobust_va(sumo.get(), &zo.v, &Nm.m, f_line, 100.0, 9.0, nullptr, line, nullptr), nullptr);
+        for (int it = 0; it < 4; ++it)
+            ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, 0.0, 0, kAll, kAll, nullptr,
+                                                       nullptr, nullptr));
+        EXPECT_EQ(sumo->obs_active->outlier, 1u);
+        // With information divided by 100 the outlier still pulls a little; without it the
+        // fit is the plain least-squares line.
+        EXPECT_NEAR(line->x.v.data[0], a, 0.05);
+        EXPECT_NEAR(line->x.v.data[1], b, 0.5);
+        WorkspacePtr ws(pSumoWorkspaceForm(nullptr));
+        ASSERT_TRUE(bSumoObsDelete(sumo.get(), ws.get(), sumo->obs_active, nullptr));
+        ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, 0.0, 0, kAll, kAll, nullptr,
+                                                   nullptr, nullptr));
+        EXPECT_NEAR(line->x.v.data[0], a, numeric ? 1e-7 : 1e-12);
+        EXPECT_NEAR(line->x.v.data[1], b, numeric ? 1e-7 : 1e-12);
+    }
+}
+
+Plx_Bool h_fails(Sumo *, SumoWorkspace *, SumoStateVector **, uint32_t, const SumoVector *, Plx_Vector *, Plx_Matrix **)
+{
+    PLX_ERR_START(PLX_ERROR_OUTSIDE_RANGE, "test failure", 0);
+    return PLX_FALSE;
+}
+
+TEST(SumoSolver, FailingObservationFailsTheIterationOnAnyThread)
+{
+    for (uint32_t jobs : {0u, 3u}) {
+        HostPtr host(jobs ? plano_host_new(jobs) : nullptr);
+        const ThreadHostInterface *iface = jobs ? plano_host_interface(host.get()) : nullptr;
+        LineFit fit(false, iface);
+        Vec z{0.0};
+        Squ Ni(1, 1.0);
+        ASSERT_NE(pSumoObsH_va(fit.sumo.get(), &z.v, &Ni.m, h_fails, nullptr, fit.line, nullptr), nullptr);
+        EXPECT_EQ(dSumoComputeResidual(fit.sumo.get(), 0, iface), SUMO_FAILED_RESIDUAL);
+        EXPECT_FALSE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
+                                                    nullptr, nullptr, iface));
+        Plx_ErrorRecord origin;
+        ASSERT_TRUE(plx_err_get_error(0, &origin));
+        EXPECT_EQ(origin.code, PLX_ERROR_OUTSIDE_RANGE);
+        EXPECT_GT(plx_err_get_error_count(), 1u);
+    }
+    vThreadedWorkerPoolFree();
+}
+
+// ---- a chain of states with hanging and sub-branches, against a dense solve ----
+
+struct Chain {
+    SumoPtr sumo;
+    WorkspacePtr ws{pSumoWorkspaceForm(nullptr)};
+    std::vector<SumoStateVector *> root_states, hang_states;
+    SumoStateVector *sub_state = nullptr;
+
+    explicit Chain(const ThreadHostInterface *host = nullptr, bool nonlinear = true) : sumo(pSumoForm(nullptr, host))
+    {
+        std::mt19937 rng(11);
+        std::uniform_real_distribution<double> u(-0.5, 0.5);
+        auto make = [&](SumoBranch *b) {
+            SumoStateVector *s = pSumoStateVectorNew(sumo.get(), b, 2, nullptr, nullptr);
+            Vec x0{u(rng), u(rng)};
+            EXPECT_TRUE(bSumoStateVectorInit(sumo.get(), s, &x0.v));
+            return s;
+        };
+        for (int i = 0; i < 4; ++i) root_states.push_back(make(sumo->root));
+        SumoBranch *hang = pSumoBranchNewFromState(sumo.get(), root_states[2]);
+        hang_states = {make(hang), make(hang)};
+        sub_state = make(pSumoBranchNewFromBranch(sumo.get(), sumo->root));
+        auto N_of = [&](int kind) -> Eigen::MatrixXd {
+            if (kind == 0) return Eigen::MatrixXd::Identity(2, 2) * 4.0;
+            if (kind == 1) return Eigen::Vector2d(2.0, 0.5).asDiagonal();
+            Eigen::MatrixXd m(2, 2);
+            m << 3.0, 0.8, 0.8, 1.5;
+            return m;
+        };
+        int kind = 0;
+        auto obs = [&](SumoHFunction f, std::vector<SumoStateVector *> st) {
+            Vec z{u(rng), u(rng)};
+            Squ N(N_of(kind++ % 3));
+            EXPECT_NE(pSumoObsH(sumo.get(), &z.v, &N.m, f, nullptr, st.data(), uint32_t(st.size())), nullptr);
+        };
+        SumoHFunction pair = nonlinear ? h_coupling : h_difference;
+        obs(h_identity, {root_states[0]});
+        obs(h_identity, {sub_state});
+        for (int i = 0; i < 3; ++i) obs(pair, {root_states[i], root_states[i + 1]});
+        obs(pair, {hang_states[0], hang_states[1]});
+        obs(pair, {hang_states[1], root_states[2]});
+        obs(pair, {hang_states[0], root_states[3]});  // fill-in across the hanging branch
+        obs(pair, {sub_state, root_states[1]});
+        obs(pair, {hang_states[0], sub_state});       // the sub-branch state is eliminated first
+    }
+    std::vector<SumoStateVector *> all() const
+    {
+        std::vector<SumoStateVector *> v = root_states;
+        v.insert(v.end(), hang_states.begin(), hang_states.end());
+        v.push_back(sub_state);
+        return v;
+    }
+};
+
+TEST(SumoSolver, ChainWithBranchesMatchesDenseGaussNewton)
+{
+    Chain c;
+    ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+    // Elimination order: sub-branch first, then the root with the hanging branch before r2.
+    EXPECT_EQ(c.sub_state->index, 0u);
+    EXPECT_EQ(c.root_states[0]->index, 1u);
+    EXPECT_EQ(c.hang_states[0]->index, 3u);
+    EXPECT_EQ(c.root_states[2]->index, 5u);
+    const DenseSystem d = dense_system(c.sumo.get());
+    const Eigen::VectorXd delta = d.H.ldlt().solve(d.g);
+    std::map<SumoStateVector *, Eigen::VectorXd> before;
+    for (SumoStateVector *s : c.all()) before[s] = params(s);
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll, nullptr,
+                                               nullptr, nullptr));
+    for (SumoStateVector *s : c.all()) {
+        const Eigen::VectorXd step = params(s) - before[s];
+        EXPECT_LT((step - delta.segment(d.offset.at(s), 2)).norm(), 1e-9) << "state " << s->index;
+    }
+    // Fill-in made the blocks the dense matrix needs: h0 (3) now meets r1 (2) through s0.
+    SumoOffdiag *fill = nullptr;
+    ASSERT_TRUE(bSumoOffdiagSearchGen(c.sumo.get(), c.root_states[1], c.hang_states[0], 0, nullptr, nullptr, &fill));
+    EXPECT_NE(fill, nullptr);
+
+    // Covariances at the new point: the blocks of the inverse dense information.
+    const DenseSystem d2 = dense_system(c.sumo.get());
+    const Eigen::MatrixXd inv = d2.H.inverse();
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 0, 0.0, 0, kAll, kAll, nullptr,
+                                               nullptr, nullptr));
+    for (SumoStateVector *s : c.all()) {
+        const int o = d2.offset.at(s);
+        EXPECT_LT((dense(s->covariance) - inv.block(o, o, 2, 2)).norm(), 1e-9) << "state " << s->index;
+        for (SumoOffdiag *k = s->row_blocks; k != nullptr; k = k->row_next) {
+            Eigen::MatrixXd P(2, 2);
+            for (int i = 0; i < 4; ++i) P(i / 2, i % 2) = k->M_cov.data[i];
+            EXPECT_LT((P - inv.block(o, d2.offset.at(k->col), 2, 2)).norm(), 1e-9);
+        }
+    }
+}
+
+TEST(SumoSolver, ReorderedStatesStillMatchTheDenseSolve)
+{
+    // Moving states changes the elimination order and flips blocks; after a solve has made
+    // fill-in blocks, the next solve must still agree with the dense one.
+    Chain c;
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 1, 0.5, 0, kAll, kAll, nullptr,
+                                               nullptr, nullptr));
+    ASSERT_TRUE(bSumoStateVectorMoveBranch(c.sumo.get(), c.ws.get(), c.root_states[0], c.sumo->root));
+    ASSERT_TRUE(bSumoStateVectorMoveBranch(c.sumo.get(), c.ws.get(), c.sub_state, c.root_states[2]->sub_branch));
+    ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+    EXPECT_EQ(c.sumo->root->last, c.root_states[0]);
+    const DenseSystem d = dense_system(c.sumo.get());
+    const Eigen::VectorXd delta = d.H.ldlt().solve(d.g);
+    std::map<SumoStateVector *, Eigen::VectorXd> before;
+    for (SumoStateVector *s : c.all()) before[s] = params(s);
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll, nullptr,
+                                               nullptr, nullptr));
+    for (SumoStateVector *s : c.all())
+        EXPECT_LT((params(s) - before[s] - delta.segment(d.offset.at(s), 2)).norm(), 1e-9) << "state " << s->index;
+}
+
+TEST(SumoSolver, StateRangeSolvesItsRunWithTheRestHeld)
+{
+    Chain c;
+    ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+    const DenseSystem d = dense_system(c.sumo.get());
+    // r1..r3 with r2's hanging branch: indices 2..6; the others stay fixed.
+    SumoStateVector *first = c.root_states[1], *last = c.root_states[3];
+    uint32_t lo, hi;
+    ASSERT_TRUE(bSumoGetIndexLimitsStateRange(first, last, &lo, &hi));
+    EXPECT_EQ(lo, 2u);
+    EXPECT_EQ(hi, 6u);
+    std::vector<SumoStateVector *> run = {c.root_states[1], c.hang_states[0], c.hang_states[1], c.root_states[2],
+                                          c.root_states[3]};
+    Eigen::MatrixXd H(10, 10);
+    Eigen::VectorXd g(10);
+    for (int i = 0; i < 5; ++i) {
+        g.segment(2 * i, 2) = d.g.segment(d.offset.at(run[i]), 2);
+        for (int j = 0; j < 5; ++j) H.block(2 * i, 2 * j, 2, 2) = d.H.block(d.offset.at(run[i]), d.offset.at(run[j]), 2, 2);
+    }
+    const Eigen::VectorXd delta = H.ldlt().solve(g);
+    std::map<SumoStateVector *, Eigen::VectorXd> before;
+    for (SumoStateVector *s : c.all()) before[s] = params(s);
+    ASSERT_TRUE(bSumoLevMarqIterationStateRange(c.sumo.get(), first, last, 0.0, 0, lo, hi, nullptr, nullptr, nullptr));
+    for (int i = 0; i < 5; ++i) EXPECT_LT((params(run[i]) - before[run[i]] - delta.segment(2 * i, 2)).norm(), 1e-9);
+    EXPECT_EQ(params(c.root_states[0]), before[c.root_states[0]]);
+    EXPECT_EQ(params(c.sub_state), before[c.sub_state]);
+
+    // An unset first index with a set last index is refused; both unset builds nothing.
+    EXPECT_FALSE(bSumoBuildInformationBlocksStateRange(c.sumo.get(), first, last, kAll, 4, nullptr));
+    EXPECT_EQ(error_code(), PLX_ERROR_INCOMPATIBLE);
+    EXPECT_TRUE(bSumoBuildInformationBlocksStateRange(c.sumo.get(), first, last, kAll, kAll, nullptr));
+    EXPECT_EQ(first->A_work.data[0], first->A.data[0]);
+}
+
+TEST(SumoSolver, SameParametersForAnyNumberOfJobs)
+{
+    auto solve = [](const ThreadHostInterface *host, bool range) {
+        Chain c(host);
+        // Central differences on some observations: jobs sharing a state must not see each
+        // other's steps.
+        for (SumoObs *o = c.sumo->obs_active; o != nullptr; o = o->next->next) {
+            o->numeric_jacobians = 1;
+            if (o->next == nullptr) break;
+        }
+        double lambda = 1e-2;
+        for (int it = 0; it < 6; ++it) {
+            uint32_t accepted;
+            if (range) {
+                EXPECT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+                EXPECT_TRUE(bSumoLevMarqIterationStateRange(c.sumo.get(), c.root_states[0], c.root_states[3], lambda,
+                                                            1, 1, 6, &accepted, nullptr, host));
+            } else {
+                EXPECT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 1, lambda, 1, kAll,
+                                                           kAll, &accepted, nullptr, host));
+            }
+            lambda *= accepted ? 0.3 : 10.0;
+        }
+        std::vector<double> x;
+        for (SumoStateVector *s : c.all())
+            for (int i = 0; i < 2; ++i) x.push_back(s->x.v.data[i]);
+        return x;
+    };
+    // Accumulation order differs between job counts, and the central differences keep the
+    // iteration from converging quadratically, so agreement is to rounding amplified a little;
+    // a job seeing another's difference step would be off by about the step (1e-7).
+    for (bool range : {false, true}) {
+        const std::vector<double> reference = solve(nullptr, range);
+        for (uint32_t jobs : {1u, 2u, 5u}) {
+            HostPtr host(plano_host_new(jobs));
+            const std::vector<double> x = solve(plano_host_interface(host.get()), range);
+            ASSERT_EQ(x.size(), reference.size());
+            for (size_t i = 0; i < x.size(); ++i)
+                EXPECT_NEAR(x[i], reference[i], 1e-9 * (1.0 + std::abs(reference[i]))) << jobs << " jobs";
+        }
+    }
+    vThreadedWorkerPoolFree();
+}
+
+// ---- a homography from noisy point pairs ----
+
+struct PointPair {
+    double x, y;
+};
+
+Plx_Bool h_project(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t, const SumoVector *z, Plx_Vector *h,
+                   Plx_Matrix **J)
+{
+    const double *H = s[0]->x.v.data;
+    const auto *p = static_cast<const PointPair *>(z->user_data);
+    const double u = H[0] * p->x + H[1] * p->y + H[2];
+    const double v = H[3] * p->x + H[4] * p->y + H[5];
+    const double w = H[6] * p->x + H[7] * p->y + H[8];
+    h->data[0] = u / w;
+    h->data[1] = v / w;
+    if (J != nullptr && J[0] != nullptr) {
+        double *j = J[0]->data;
+        const double q[3] = {p->x, p->y, 1.0};
+        for (int k = 0; k < 3; ++k) {
+            j[k] = q[k] / w;
+            j[3 + k] = 0.0;
+            j[6 + k] = -u * q[k] / (w * w);
+            j[9 + k] = 0.0;
+            j[12 + k] = q[k] / w;
+            j[15 + k] = -v * q[k] / (w * w);
+        }
+    }
+    return PLX_TRUE;
+}
+
+// Holds the free scale: sum of squares of the entries, with twice the entries as Jacobian.
+Plx_Bool h_scale(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t, const SumoVector *, Plx_Vector *h,
+                 Plx_Matrix **J)
+{
+    const uint32_t n = s[0]->x.v.rows;
+    double ss = 0.0;
+    for (uint32_t i = 0; i < n; ++i) ss += s[0]->x.v.data[i] * s[0]->x.v.data[i];
+    h->data[0] = ss;
+    if (J != nullptr && J[0] != nullptr)
+        for (uint32_t i = 0; i < n; ++i) J[0]->data[i] = 2.0 * s[0]->x.v.data[i];
+    return PLX_TRUE;
+}
+
+TEST(SumoSolver, HomographyFromNoisyPointPairs)
+{
+    Eigen::Matrix3d truth;
+    truth << 1.1, 0.05, 3.0, -0.08, 0.95, -2.0, 1e-3, -2e-3, 1.0;
+    truth /= truth.norm();
+    std::mt19937 rng(3);
+    std::normal_distribution<double> noise(0.0, 0.01);
+    std::vector<PointPair> pts;
+    for (int i = 0; i < 5; ++i)
+        for (int j = 0; j < 5; ++j) pts.push_back({i * 20.0 - 40.0, j * 20.0 - 40.0});
+
+    std::vector<Eigen::VectorXd> solutions;
+    for (bool numeric : {false, true}) {
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *H = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        Eigen::VectorXd x0(9);
+        for (int i = 0; i < 9; ++i) x0[i] = truth(i / 3, i % 3) * (1.0 + 0.02 * ((i % 2) ? 1 : -1));
+        x0 /= x0.norm();
+        Vec v0(x0);
+        ASSERT_TRUE(bSumoStateVectorInit(sumo.get(), H, &v0.v));
+        std::mt19937 local(5);
+        for (const PointPair &p : pts) {
+            const Eigen::Vector3d q = truth * Eigen::Vector3d(p.x, p.y, 1.0);
+            Vec z{q[0] / q[2] + noise(local), q[1] / q[2] + noise(local)};
+            Squ Ni(2, 1e4);
+            SumoObs *o = pSumoObsH_va(sumo.get(), &z.v, &Ni.m, h_project, nullptr, H, nullptr);
+            ASSERT_NE(o, nullptr);
+            o->z.user_data = const_cast<PointPair *>(&p);
+            o->numeric_jacobians = numeric ? 1u : 0u;
+            H->jacobian_step = 1e-8;
+        }
+        Vec one{1.0};
+        Squ thousand(1, 1000.0);
+        ASSERT_NE(pSumoObsH_va(sumo.get(), &one.v, &thousand.m, h_scale, nullptr, H, nullptr), nullptr);
+        double lambda = 1e-3;
+        for (int it = 0; it < 30; ++it) {
+            uint32_t accepted;
+            ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, lambda, 0, kAll, kAll,
+                                                       &accepted, nullptr, nullptr));
+            lambda *= accepted ? 0.1 : 10.0;
+        }
+        // At the optimum the dense gradient vanishes and the fit is better than the truth.
+        const DenseSystem d = dense_system(sumo.get());
+        EXPECT_LT(d.g.norm(), 1e-6 * d.H.norm() * params(H).norm());
+        const double fitted = dSumoComputeResidual(sumo.get(), 0, nullptr);
+        const Eigen::VectorXd x = params(H);
+        Eigen::VectorXd t(9);
+        for (int i = 0; i < 9; ++i) t[i] = truth(i / 3, i % 3);
+        set_params(H, t);
+        EXPECT_LT(fitted, dSumoComputeResidual(sumo.get(), 0, nullptr));
+        EXPECT_NEAR(x.norm(), 1.0, 1e-3);
+        EXPECT_LT((x - t).norm(), 1e-3);
+        solutions.push_back(x);
+    }
+    EXPECT_LT((solutions[0] - solutions[1]).norm(), 1e-7);
+}
+
+Plx_Bool h_cube(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t, const SumoVector *, Plx_Vector *h,
+                Plx_Matrix **J)
+{
+    const double x = s[0]->x.v.data[0];
+    h->data[0] = x * x * x;
+    if (J != nullptr && J[0] != nullptr) J[0]->data[0] = 3.0 * x * x;
+    return PLX_TRUE;
+}
+
+TEST(SumoSolver, RejectedStepsLeaveParametersExactly)
+{
+    SumoPtr sumo(pSumoForm(nullptr, nullptr));
+    SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 1, nullptr, nullptr);
+    Vec x0{0.01};
+    ASSERT_TRUE(bSumoStateVectorInit(sumo.get(), s, &x0.v));
+    Vec z{1.0};
+    Squ Ni(1, 1.0);
+    ASSERT_NE(pSumoObsH_va(sumo.get(), &z.v, &Ni.m, h_cube, nullptr, s, nullptr), nullptr);
+    // The undamped step overshoots by thousands: the cost rises and the step is undone.
+    uint32_t accepted = 9;
+    double reduction = 5.0;
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, 0.0, 0, kAll, kAll, &accepted,
+                                               &reduction, nullptr));
+    EXPECT_EQ(accepted, 0u);
+    EXPECT_EQ(reduction, 0.0);
+    EXPECT_EQ(s->x.v.data[0], 0.01);
+    // A state without information cannot be factored: rejected without an error.
+    SumoStateVector *lonely = pSumoStateVectorNew(sumo.get(), sumo->root, 2, nullptr, nullptr);
+    Vec x1{0.25, 0.5};
+    ASSERT_TRUE(bSumoStateVectorInit(sumo.get(), lonely, &x1.v));
+    plx_err_flush_trace();
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, 1.0, 0, kAll, kAll, &accepted,
+                                               &reduction, nullptr));
+    EXPECT_EQ(accepted, 0u);
+    EXPECT_EQ(plx_err_get_error_count(), 0u);
+    EXPECT_EQ(s->x.v.data[0], 0.01);
+    EXPECT_EQ(lonely->x.v.data[1], 0.5);
+    // Additive damping makes it solvable; the cube then moves towards its root.
+    ASSERT_TRUE(bSumoLevMarqIterationBranchGen(sumo.get(), sumo->root, nullptr, 1, 1.0, SUMO_DAMP_ADDITIVE, kAll, kAll,
+                                               &accepted, &reduction, nullptr));
+    EXPECT_EQ(accepted, 1u);
+    EXPECT_GT(s->x.v.data[0], 0.01);
+    EXPECT_EQ(lonely->x.v.data[1], 0.5);
+}
+
+TEST(SumoSolver, RelaxationConvergesToTheEliminationSolution)
+{
+    for (bool sor : {false, true}) {
+        Chain c(nullptr, false);
+        ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+        const DenseSystem d = dense_system(c.sumo.get());
+        const Eigen::VectorXd delta = d.H.ldlt().solve(d.g);
+        std::map<SumoStateVector *, Eigen::VectorXd> before;
+        for (SumoStateVector *s : c.all()) before[s] = params(s);
+        ASSERT_TRUE(bSumoRelaxationInitBranch(c.sumo.get(), c.sumo->root, kAll, kAll, nullptr));
+        double previous = dSumoRelaxationResidualBranch(c.sumo.get(), c.sumo->root);
+        EXPECT_NEAR(previous, d.g.squaredNorm(), 1e-9 * d.g.squaredNorm());
+        for (int it = 0; it < 300; ++it) {
+            ASSERT_TRUE(sor ? bSumoSORIterationBranch(c.sumo.get(), c.sumo->root, 1.2)
+                            : bSumoGaussSeidelIterationBranch(c.sumo.get()));
+            const double r = dSumoRelaxationResidualBranch(c.sumo.get(), c.sumo->root);
+            if (it < 5) {
+                EXPECT_LT(r, previous);
+            }
+            previous = r;
+        }
+        EXPECT_LT(previous, 1e-20);
+        ASSERT_TRUE(bSumoRelaxationFinishBranch(c.sumo.get(), c.sumo->root, nullptr));
+        for (SumoStateVector *s : c.all())
+            EXPECT_LT((params(s) - before[s] - delta.segment(d.offset.at(s), 2)).norm(), 1e-9);
+        EXPECT_NEAR(c.sumo->residual, dSumoComputeResidual(c.sumo.get(), 0, nullptr), 1e-12);
+    }
+}
+
+}  // namespace
