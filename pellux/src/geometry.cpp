@@ -148,7 +148,7 @@ PLX_API void plx_psinv_free(Plx_PseudoInverseSolver *solver)
 PLX_API Plx_Bool plx_homog33_increment_p(Plx_SquMatrix *A, const Plx_Vector3 *x, const Plx_Vector3 *xp)
 {
     if (A == nullptr || A->data == nullptr || x == nullptr || xp == nullptr) return null_argument(__func__);
-    if (A->type != PLX_SQUMAT_SYMMETRIC || A->size != 9) {
+    if (plx::squmat_raw_type(A) != PLX_SQUMAT_SYMMETRIC || A->size != 9) {
         PLX_ERR_START(PLX_ERROR_INCOMPATIBLE, "accumulator must be a 9x9 symmetric matrix", A->size);
         return PLX_FALSE;
     }
@@ -173,7 +173,7 @@ PLX_API Plx_Bool plx_homog33_increment_p(Plx_SquMatrix *A, const Plx_Vector3 *x,
 PLX_API Plx_Bool plx_homog33_solve(const Plx_SquMatrix *A, uint32_t equations, Plx_Matrix33 *H)
 {
     if (A == nullptr || A->data == nullptr || H == nullptr) return null_argument(__func__);
-    if (A->type != PLX_SQUMAT_SYMMETRIC || A->size != 9) {
+    if (plx::squmat_raw_type(A) != PLX_SQUMAT_SYMMETRIC || A->size != 9) {
         PLX_ERR_START(PLX_ERROR_INCOMPATIBLE, "accumulator must be a 9x9 symmetric matrix", A->size);
         return PLX_FALSE;
     }

@@ -2,202 +2,45 @@
 //
 // This is the hot path of smoothing and pyramids, so each line is worked in an accumulator
 // type (float for 8/16-bit and float pixels, double for the 32-bit integer and double pixels;
-// 16-bit fixed point for 8-bit pixels under a Gaussian on AVX2 machines, see below):
+// 16-bit fixed point for 8-bit pixels under a Gaussian):
 //   along x: each source row is converted once into a padded line with the edge rule
 //            applied, and every output value is sum_t k[t] * line[i + t * lanes];
 //   along y: each output row is sum_t k[t] * row(y + t - r), the source rows taken straight
 //            from the image (float and double, all channels) or converted once into a ring
 //            of 2r+1 rows.
-// Both are the same kernel: out[i] = sum_t k[t] * src[t][i] over a flat run of values. It
-// keeps four vector accumulators in registers across all taps, folds mirrored taps of a
-// symmetric mask into one multiply, and is compiled twice (AVX2+FMA and the baseline) with a
-// one-time choice by CPU. Every value goes through the same vector arithmetic whatever its
-// position in the run (a ragged tail is staged through a full vector), so results do not
-// depend on the window or band an image is cut into. They may differ in the last bit (last
-// level for integer pixels) between machines with and without AVX2.
+// Both are the same kernel (convolve_kernels.hpp), which gives the same bits on every x86-64
+// machine whichever instruction set it runs with. Every value goes through the same
+// arithmetic whatever its position in the run (a ragged tail is staged through a full vector),
+// so results do not depend on the window or band an image is cut into either.
 #include <algorithm>
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
 #include <type_traits>
 
+#include "convolve_kernels.hpp"
 #include "image_internal.hpp"
 #include "pellux/detail/pixel_traits.hpp"
 #include "pellux/detail/util.hpp"
 
-#if defined(__x86_64__) || defined(__i386__)
-#define PLX_X86 1
-#include <immintrin.h>
-#endif
 
 #define PLX_INLINE [[gnu::always_inline]] inline
 
 namespace {
 
-// ---- vector lanes of the accumulator types ----
+using plx::conv::Isa;
+using plx::conv::Lanes;
 
-template <class A>
-struct Lanes;
-template <>
-struct Lanes<float> {
-    typedef float V __attribute__((vector_size(32)));
-    static constexpr std::size_t W = 8;
-};
-template <>
-struct Lanes<double> {
-    typedef double V __attribute__((vector_size(32)));
-    static constexpr std::size_t W = 4;
-};
-
-// 8-bit pixels under a symmetric mask of small positive taps (a Gaussian) go through 16-bit
-// fixed point: values scaled by 128, taps by 2^17, products rounded down in units of 1/256
-// (with the expected loss added back once), so sixteen values go through each instruction.
-template <>
-struct Lanes<uint16_t> {
-    static constexpr std::size_t W = 16;
-};
-
-#ifdef PLX_X86
-// out[i] = bias + sum of mulhi(src[t][i] + src[ntaps-1-t][i], k[t]) (+ the centre tap), for
-// i < n, n a multiple of 16. Saturating sums: a mask summing to a little over 1 cannot wrap.
-[[gnu::target("avx2")]] void fixed_taps_avx2(uint16_t *out, const uint16_t *const *src, const uint16_t *k,
-                                             uint32_t ntaps, std::size_t n)
-{
-    const uint32_t r = ntaps / 2;
-    const __m256i bias = _mm256_set1_epi16(static_cast<short>((r + 1) / 2));
-    std::size_t i = 0;
-    for (; i + 64 <= n; i += 64) {
-        __m256i a0 = bias, a1 = bias, a2 = bias, a3 = bias;
-        for (uint32_t t = 0; t < r; ++t) {
-            const __m256i kt = _mm256_set1_epi16(static_cast<short>(k[t]));
-            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
-            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
-            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q)), kt));
-            a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 1), _mm256_loadu_si256(q + 1)), kt));
-            a2 = _mm256_adds_epu16(a2, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 2), _mm256_loadu_si256(q + 2)), kt));
-            a3 = _mm256_adds_epu16(a3, _mm256_mulhi_epu16(_mm256_add_epi16(_mm256_loadu_si256(p + 3), _mm256_loadu_si256(q + 3)), kt));
-        }
-        const __m256i kc = _mm256_set1_epi16(static_cast<short>(k[r]));
-        const __m256i *c = reinterpret_cast<const __m256i *>(src[r] + i);
-        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_loadu_si256(c), kc));
-        a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 1), kc));
-        a2 = _mm256_adds_epu16(a2, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 2), kc));
-        a3 = _mm256_adds_epu16(a3, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 3), kc));
-        __m256i *o = reinterpret_cast<__m256i *>(out + i);
-        _mm256_storeu_si256(o, a0);
-        _mm256_storeu_si256(o + 1, a1);
-        _mm256_storeu_si256(o + 2, a2);
-        _mm256_storeu_si256(o + 3, a3);
-    }
-    for (; i + 32 <= n; i += 32) {
-        __m256i a0 = bias, a1 = bias;
-        for (uint32_t t = 0; t < r; ++t) {
-            const __m256i kt = _mm256_set1_epi16(static_cast<short>(k[t]));
-            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
-            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
-            const __m256i s0 = _mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q));
-            const __m256i s1 = _mm256_add_epi16(_mm256_loadu_si256(p + 1), _mm256_loadu_si256(q + 1));
-            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(s0, kt));
-            a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(s1, kt));
-        }
-        const __m256i kc = _mm256_set1_epi16(static_cast<short>(k[r]));
-        const __m256i *c = reinterpret_cast<const __m256i *>(src[r] + i);
-        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(_mm256_loadu_si256(c), kc));
-        a1 = _mm256_adds_epu16(a1, _mm256_mulhi_epu16(_mm256_loadu_si256(c + 1), kc));
-        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i), a0);
-        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i + 16), a1);
-    }
-    for (; i + 16 <= n; i += 16) {
-        __m256i a0 = bias;
-        for (uint32_t t = 0; t < r; ++t) {
-            const __m256i *p = reinterpret_cast<const __m256i *>(src[t] + i);
-            const __m256i *q = reinterpret_cast<const __m256i *>(src[ntaps - 1 - t] + i);
-            const __m256i s0 = _mm256_add_epi16(_mm256_loadu_si256(p), _mm256_loadu_si256(q));
-            a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(s0, _mm256_set1_epi16(static_cast<short>(k[t]))));
-        }
-        const __m256i c0 = _mm256_loadu_si256(reinterpret_cast<const __m256i *>(src[r] + i));
-        a0 = _mm256_adds_epu16(a0, _mm256_mulhi_epu16(c0, _mm256_set1_epi16(static_cast<short>(k[r]))));
-        _mm256_storeu_si256(reinterpret_cast<__m256i *>(out + i), a0);
-    }
-}
-#endif
-
-// ---- the kernel ----
-
-// out[i] = sum_t k[t] * src[t][i] for i < n, n a multiple of the vector width. With Sym the
-// mask is symmetric (k[t] == k[ntaps-1-t]) and mirrored taps share one multiply.
-template <class A, bool Sym>
-PLX_INLINE void taps_run_float(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
-{
-    using V = typename Lanes<A>::V;
-    constexpr std::size_t W = Lanes<A>::W;
-    const uint32_t r = ntaps / 2;
-    std::size_t i = 0;
-    for (; i + 4 * W <= n; i += 4 * W) {
-        V a0 = {}, a1 = {}, a2 = {}, a3 = {};
-        V x0, x1, x2, x3, y0, y1, y2, y3;
-        if constexpr (Sym) {
-            for (uint32_t t = 0; t < r; ++t) {
-                const A *p = src[t] + i, *q = src[ntaps - 1 - t] + i;
-                const A kt = k[t];
-                std::memcpy(&x0, p, sizeof x0);
-                std::memcpy(&x1, p + W, sizeof x1);
-                std::memcpy(&x2, p + 2 * W, sizeof x2);
-                std::memcpy(&x3, p + 3 * W, sizeof x3);
-                std::memcpy(&y0, q, sizeof y0);
-                std::memcpy(&y1, q + W, sizeof y1);
-                std::memcpy(&y2, q + 2 * W, sizeof y2);
-                std::memcpy(&y3, q + 3 * W, sizeof y3);
-                a0 += kt * (x0 + y0);
-                a1 += kt * (x1 + y1);
-                a2 += kt * (x2 + y2);
-                a3 += kt * (x3 + y3);
-            }
-        }
-        for (uint32_t t = Sym ? r : 0; t < (Sym ? r + 1 : ntaps); ++t) {
-            const A *p = src[t] + i;
-            const A kt = k[t];
-            std::memcpy(&x0, p, sizeof x0);
-            std::memcpy(&x1, p + W, sizeof x1);
-            std::memcpy(&x2, p + 2 * W, sizeof x2);
-            std::memcpy(&x3, p + 3 * W, sizeof x3);
-            a0 += kt * x0;
-            a1 += kt * x1;
-            a2 += kt * x2;
-            a3 += kt * x3;
-        }
-        std::memcpy(out + i, &a0, sizeof a0);
-        std::memcpy(out + i + W, &a1, sizeof a1);
-        std::memcpy(out + i + 2 * W, &a2, sizeof a2);
-        std::memcpy(out + i + 3 * W, &a3, sizeof a3);
-    }
-    for (; i + W <= n; i += W) {
-        V a0 = {}, x0, y0;
-        if constexpr (Sym) {
-            for (uint32_t t = 0; t < r; ++t) {
-                std::memcpy(&x0, src[t] + i, sizeof x0);
-                std::memcpy(&y0, src[ntaps - 1 - t] + i, sizeof y0);
-                a0 += k[t] * (x0 + y0);
-            }
-        }
-        for (uint32_t t = Sym ? r : 0; t < (Sym ? r + 1 : ntaps); ++t) {
-            std::memcpy(&x0, src[t] + i, sizeof x0);
-            a0 += k[t] * x0;
-        }
-        std::memcpy(out + i, &a0, sizeof a0);
-    }
-}
-
-template <class A, bool Sym>
+template <class A, bool Sym, Isa I>
 PLX_INLINE void taps_run(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
 {
-#ifdef PLX_X86
-    if constexpr (std::is_same_v<A, uint16_t>) {
-        fixed_taps_avx2(out, src, k, ntaps, n);
+#ifdef PLX_CONV_X86
+    if constexpr (I == Isa::avx2) {
+        plx::conv::taps_avx2<A, Sym>(out, src, k, ntaps, n);
         return;
-    } else
+    }
 #endif
-        taps_run_float<A, Sym>(out, src, k, ntaps, n);
+    plx::conv::taps_baseline<A, Sym>(out, src, k, ntaps, n);
 }
 
 // Scratch of one convolution call, carved from one heap block.
@@ -216,13 +59,13 @@ struct Scratch {
 };
 
 // The kernel over any n: whole vectors in place, the tail staged through one full vector.
-template <class A, bool Sym>
+template <class A, bool Sym, Isa I>
 PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n,
                            const Scratch<A> &s)
 {
     constexpr std::size_t W = Lanes<A>::W;
     const std::size_t whole = n - n % W;
-    taps_run<A, Sym>(out, src, s.k, ntaps, whole);
+    taps_run<A, Sym, I>(out, src, s.k, ntaps, whole);
     if (whole == n) return;
     const std::size_t rest = n - whole;
     for (uint32_t t = 0; t < ntaps; ++t) {
@@ -232,7 +75,7 @@ PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::siz
         s.stage_src[t] = st;
     }
     A *tail = s.stage + std::size_t(ntaps) * W;
-    taps_run<A, Sym>(tail, s.stage_src, s.k, ntaps, W);
+    taps_run<A, Sym, I>(tail, s.stage_src, s.k, ntaps, W);
     std::memcpy(out + whole, tail, rest * sizeof(A));
 }
 
@@ -338,7 +181,7 @@ PLX_INLINE T *row_of(Plx_Image *im, int64_t r, std::size_t offset)
     return static_cast<T *>(plx_image_row(im, static_cast<int32_t>(r))) + offset;
 }
 
-template <class T, class A, bool Sym>
+template <class T, class A, bool Sym, Isa I>
 PLX_INLINE void pass_x(const Pass &p, const Scratch<A> &s)
 {
     const int64_t w = p.source->width;
@@ -361,15 +204,15 @@ PLX_INLINE void pass_x(const Pass &p, const Scratch<A> &s)
         }
         T *o = row_of<T>(p.dest, y, p.offset);
         if (direct) {
-            apply_taps<A, Sym>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+            apply_taps<A, Sym, I>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
         } else {
-            apply_taps<A, Sym>(s.out, s.src, p.ntaps, n, s);
+            apply_taps<A, Sym, I>(s.out, s.src, p.ntaps, n, s);
             store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
         }
     }
 }
 
-template <class T, class A, bool Sym>
+template <class T, class A, bool Sym, Isa I>
 PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
 {
     const int64_t h = p.source->height, w = p.source->width;
@@ -410,48 +253,44 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
         }
         T *o = row_of<T>(p.dest, y, p.offset);
         if (direct) {
-            apply_taps<A, Sym>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+            apply_taps<A, Sym, I>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
         } else {
-            apply_taps<A, Sym>(s.out, s.src, p.ntaps, n, s);
+            apply_taps<A, Sym, I>(s.out, s.src, p.ntaps, n, s);
             store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
         }
     }
 }
 
-template <class T, class A, bool Sym, bool AlongY>
+template <class T, class A, bool Sym, bool AlongY, Isa I>
 PLX_INLINE void run_pass(const Pass &p, const Scratch<A> &s)
 {
     if constexpr (AlongY)
-        pass_y<T, A, Sym>(p, s);
+        pass_y<T, A, Sym, I>(p, s);
     else
-        pass_x<T, A, Sym>(p, s);
+        pass_x<T, A, Sym, I>(p, s);
 }
 
+// The pass compiled once per instruction set (conversions vectorise wider with AVX2); the
+// arithmetic is the same in both, products and sums never fused.
 template <class T, class A, bool Sym, bool AlongY>
-void run_pass_baseline(const Pass &p, const Scratch<A> &s)
+[[gnu::optimize("fp-contract=off")]] void run_pass_baseline(const Pass &p, const Scratch<A> &s)
 {
-    run_pass<T, A, Sym, AlongY>(p, s);
+    run_pass<T, A, Sym, AlongY, Isa::baseline>(p, s);
 }
 
-#ifdef PLX_X86
+#ifdef PLX_CONV_X86
 template <class T, class A, bool Sym, bool AlongY>
-[[gnu::target("avx2,fma")]] void run_pass_avx2(const Pass &p, const Scratch<A> &s)
+[[gnu::target("avx2"), gnu::optimize("fp-contract=off")]] void run_pass_avx2(const Pass &p, const Scratch<A> &s)
 {
-    run_pass<T, A, Sym, AlongY>(p, s);
-}
-
-bool cpu_has_avx2_fma()
-{
-    static const bool has = __builtin_cpu_supports("avx2") && __builtin_cpu_supports("fma");
-    return has;
+    run_pass<T, A, Sym, AlongY, Isa::avx2>(p, s);
 }
 #endif
 
 template <class T, class A, bool Sym, bool AlongY>
 void dispatch_pass(const Pass &p, const Scratch<A> &s)
 {
-#ifdef PLX_X86
-    if (cpu_has_avx2_fma()) {
+#ifdef PLX_CONV_X86
+    if (plx::conv::machine_isa() == Isa::avx2) {
         run_pass_avx2<T, A, Sym, AlongY>(p, s);
         return;
     }
@@ -547,12 +386,10 @@ bool convolve_typed(Pass &p, const Plx_Mask1D *mask, const char *function)
     if (AlongY) std::fill(s.zero, s.zero + n, A(0));
     mask_values(mask, s.k);
 
-#ifdef PLX_X86
     if constexpr (std::is_same_v<A, uint16_t>) {
-        run_pass_avx2<T, A, true, AlongY>(p, s);  // chosen only on such machines
+        dispatch_pass<T, A, true, AlongY>(p, s);  // chosen only for symmetric masks
         return true;
     }
-#endif
     bool symmetric = true;
     for (std::size_t t = 0; t < r; ++t) symmetric = symmetric && s.k[t] == s.k[ntaps - 1 - t];
     if (symmetric)
@@ -642,14 +479,12 @@ Plx_Bool convolve(const Plx_Image *source, int32_t channel, Plx_EdgeBehaviour ed
     bool ok = true;
     plx::dispatch_numeric_type(source->type, [&](auto tag) {
         using T = decltype(tag);
-#ifdef PLX_X86
         if constexpr (std::is_same_v<T, uint8_t>) {
-            if (cpu_has_avx2_fma() && fixed_point_suits(mask)) {
+            if (fixed_point_suits(mask)) {
                 ok = convolve_typed<T, uint16_t, AlongY>(p, mask, function);
                 return;
             }
         }
-#endif
         ok = convolve_typed<T, typename plx::PixelTraits<T>::Accum, AlongY>(p, mask, function);
     });
     return ok ? 1 : 0;

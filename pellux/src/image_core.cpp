@@ -3,6 +3,8 @@
 #include <cstdlib>
 #include <cstring>
 
+#include <sys/mman.h>
+
 #include "image_internal.hpp"
 #include "image_ops.hpp"
 #include "pellux/detail/util.hpp"
@@ -73,8 +75,22 @@ bool allocate_pixels(Plx_Image *image, const char *function)
         return true;
     }
     if (image->block == nullptr || image->block_size < bytes) {
-        void *block = plx::heap_alloc<unsigned char>(bytes, function, __FILE__, __LINE__);
-        if (block == nullptr) return false;
+        // Blocks start on a cache line: vector loads of row 0 then never straddle two lines,
+        // and row-major passes over narrow columns touch fewer lines.
+        // Large blocks go on huge pages where the system offers them: a pass down narrow
+        // columns touches one row per small page, more pages than the TLB holds.
+        constexpr std::size_t huge = std::size_t(2) << 20;
+        const bool large = bytes >= 2 * huge;
+        void *block = nullptr;
+        if (posix_memalign(&block, large ? huge : 64, bytes) != 0) {
+            plx_err_flush_trace();
+            plx_err_register_fileline(function, PLX_ERROR_MALLOC_FAILED, __FILE__, __LINE__, "",
+                                      static_cast<int64_t>(bytes));
+            return false;
+        }
+#ifdef MADV_HUGEPAGE
+        if (large) madvise(block, bytes / huge * huge, MADV_HUGEPAGE);  // advice only; failure is harmless
+#endif
         std::free(image->block);
         image->block = block;
         image->block_size = bytes;

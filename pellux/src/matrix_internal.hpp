@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <new>
 
 #include "pellux/detail/util.hpp"
@@ -32,10 +33,21 @@ inline std::size_t squmat_stored(Plx_SquMatrixType type, uint32_t size)
     }
 }
 
-inline bool squmat_known_type(Plx_SquMatrixType type)
+inline bool squmat_known_type(int64_t type)
 {
     return type >= PLX_SQUMAT_SYMMETRIC && type <= PLX_SQUMAT_GENERIC;
 }
+
+// The type field of a record as the integer the caller stored: a C caller may store any
+// value, and loading one outside the enumeration as the C++ enum type is undefined.
+inline int32_t squmat_raw_type(const Plx_SquMatrixType &type)
+{
+    static_assert(sizeof(Plx_SquMatrixType) == sizeof(int32_t));
+    int32_t raw;
+    std::memcpy(&raw, &type, sizeof raw);
+    return raw;
+}
+inline int32_t squmat_raw_type(const Plx_SquMatrix *A) { return squmat_raw_type(A->type); }
 
 // True when the structure keeps all n x n values in a full row-major array.
 inline bool squmat_is_full(Plx_SquMatrixType type)

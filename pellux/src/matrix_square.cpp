@@ -51,7 +51,7 @@ using MapCM = Eigen::Map<const RMat>;
 using MapV = Eigen::Map<Eigen::VectorXd>;
 using MapCV = Eigen::Map<const Eigen::VectorXd>;
 
-bool check_type(Plx_SquMatrixType type, const char *function)
+bool check_type(int64_t type, const char *function)
 {
     if (plx::squmat_known_type(type)) return true;
     PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_TYPE, "unknown square matrix type", type);
@@ -64,7 +64,7 @@ inline std::size_t stored(const Plx_SquMatrix *A) { return plx::squmat_stored(A-
 bool check(const Plx_SquMatrix *A, const char *function)
 {
     if (A == nullptr) return null_argument(function);
-    if (!check_type(A->type, function)) return false;
+    if (!check_type(plx::squmat_raw_type(A), function)) return false;
     if (A->data == nullptr && stored(A) > 0) return null_argument(function);
     return true;
 }
@@ -257,7 +257,7 @@ extern "C" {
 
 PLX_API Plx_SquMatrix *plx_squmat_form(Plx_SquMatrix *A, Plx_SquMatrixType type, uint32_t size)
 {
-    if (!check_type(type, __func__)) return nullptr;
+    if (!check_type(plx::squmat_raw_type(type), __func__)) return nullptr;
     return plx::form_record(A, Plx_SquMatrix{type, size, nullptr, 0, 0, 0}, plx::squmat_stored(type, size), __func__);
 }
 
@@ -271,7 +271,7 @@ PLX_API Plx_SquMatrix *plx_squmat_new(Plx_SquMatrixType type, uint32_t size)
 PLX_API Plx_SquMatrix *plx_squmat_form_data(Plx_SquMatrix *A, Plx_SquMatrixType type, uint32_t size,
                                             double *data)
 {
-    if (!check_type(type, __func__)) return nullptr;
+    if (!check_type(plx::squmat_raw_type(type), __func__)) return nullptr;
     std::size_t n = plx::squmat_stored(type, size);
     if (data == nullptr && n > 0) {
         null_argument(__func__);
@@ -283,7 +283,7 @@ PLX_API Plx_SquMatrix *plx_squmat_form_data(Plx_SquMatrix *A, Plx_SquMatrixType 
 PLX_API Plx_Bool plx_squmat_resize(Plx_SquMatrix *A, Plx_SquMatrixType type, uint32_t size)
 {
     if (A == nullptr) return null_argument(__func__);
-    if (!check_type(type, __func__)) return PLX_FALSE;
+    if (!check_type(plx::squmat_raw_type(type), __func__)) return PLX_FALSE;
     if (!plx::ensure_block(A->data, A->capacity, A->data_owned, plx::squmat_stored(type, size), __func__))
         return PLX_FALSE;
     A->type = type;
@@ -353,7 +353,7 @@ PLX_API Plx_Bool plx_squmat_read(const Plx_SquMatrix *A, double *values)
 
 PLX_API double plx_squmat_get(const Plx_SquMatrix *A, uint32_t row, uint32_t col)
 {
-    if (A == nullptr || A->data == nullptr || !plx::squmat_known_type(A->type) || row >= A->size || col >= A->size)
+    if (A == nullptr || A->data == nullptr || !plx::squmat_known_type(plx::squmat_raw_type(A)) || row >= A->size || col >= A->size)
         return std::numeric_limits<double>::quiet_NaN();
     return plx::squmat_at(A, row, col);
 }

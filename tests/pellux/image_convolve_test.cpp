@@ -1,11 +1,14 @@
 // 1D convolution against a plain reference, and Gaussian masks.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cmath>
+#include <random>
 #include <cstring>
 #include <vector>
 
 #include "common/reference_convolve.hpp"
+#include "convolve_kernels.hpp"
 #include "pellux/detail/pixel_traits.hpp"
 #include "pellux/pellux.h"
 
@@ -289,4 +292,112 @@ TEST(Convolve1D, BadArgumentsFailWithTheirCodesAndLeaveDestAlone)
     for (Plx_Image *im : {src, dst, small, other, bits, bits2, before, empty, empty2}) plx_image_free(im);
     plx_image_free(&overlap);
     plx_image_free(&src5);
+}
+
+// ---- the same bits whichever instruction set the kernel runs with ----
+
+namespace {
+
+// Runs the kernel of every build over the same sources (each starting at an odd offset, runs
+// of several lengths) and requires identical bits; fixed point also against its lane model.
+template <class A, bool Sym>
+void expect_same_bits_on_every_build(uint32_t ntaps, uint32_t seed)
+{
+    constexpr std::size_t W = plx::conv::Lanes<A>::W;
+    std::mt19937 gen(seed);
+    std::vector<A> k(ntaps);
+    for (uint32_t t = 0; t <= ntaps / 2; ++t) {
+        if constexpr (std::is_same_v<A, uint16_t>)
+            k[t] = k[ntaps - 1 - t] = A(std::uniform_int_distribution<int>(0, 65535 / ntaps)(gen));
+        else
+            k[t] = A(std::uniform_real_distribution<double>(-1, 1)(gen)), k[ntaps - 1 - t] = Sym ? k[t] : A(std::uniform_real_distribution<double>(-1, 1)(gen));
+    }
+    for (std::size_t n : {W, 3 * W, 4 * W, 9 * W, 13 * W}) {
+        std::vector<A> pool(std::size_t(ntaps) * (n + 9) + 1);
+        for (A &v : pool) {
+            if constexpr (std::is_same_v<A, uint16_t>)
+                v = A(std::uniform_int_distribution<int>(0, 255)(gen) << 7);
+            else
+                v = A(std::uniform_real_distribution<double>(-100, 100)(gen));
+        }
+        std::vector<const A *> src(ntaps);
+        for (uint32_t t = 0; t < ntaps; ++t) src[t] = pool.data() + t * (n + 7) + 2 * t + 1;  // odd, unaligned
+        std::vector<A> base(n), wide(n);
+        plx::conv::taps<A, Sym>(plx::conv::Isa::baseline, base.data(), src.data(), k.data(), ntaps, n);
+        plx::conv::taps<A, Sym>(plx::conv::Isa::avx2, wide.data(), src.data(), k.data(), ntaps, n);
+        ASSERT_EQ(std::memcmp(base.data(), wide.data(), n * sizeof(A)), 0) << "taps " << ntaps << " run " << n;
+        if constexpr (std::is_same_v<A, uint16_t>) {
+            std::vector<A> model(n);
+            plx::conv::fixed_taps_scalar(model.data(), src.data(), k.data(), ntaps, n);
+            ASSERT_EQ(model, base) << "taps " << ntaps << " run " << n;
+        }
+    }
+}
+
+}  // namespace
+
+TEST(ConvolveKernels, SameBitsOnEveryInstructionSet)
+{
+#if defined(__x86_64__) || defined(__i386__)
+    if (!__builtin_cpu_supports("avx2")) GTEST_SKIP() << "no AVX2 on this machine";
+#endif
+    uint32_t seed = 1;
+    for (uint32_t ntaps : {1u, 3u, 9u, 17u, 33u}) {
+        expect_same_bits_on_every_build<float, true>(ntaps, seed++);
+        expect_same_bits_on_every_build<float, false>(ntaps, seed++);
+        expect_same_bits_on_every_build<double, true>(ntaps, seed++);
+        expect_same_bits_on_every_build<double, false>(ntaps, seed++);
+        expect_same_bits_on_every_build<uint16_t, true>(ntaps, seed++);
+    }
+}
+
+// Whole convolutions of float and double images (odd sizes, a view at an odd offset) give,
+// value by value, the bits of the baseline kernel: the library's result is the one every
+// machine gives, wherever a value sits in its run.
+template <class T>
+void expect_baseline_bits(const std::vector<double> &taps, bool along_y)
+{
+    constexpr std::size_t W = plx::conv::Lanes<T>::W;
+    const Plx_PixelType type = plx::PixelTraits<T>::code;
+    Plx_Image *parent = plx_image_form_gen(nullptr, PLX_FORMAT_GREY, type, 24, 40);
+    Plx_Image *dest = plx_image_form_gen(nullptr, PLX_FORMAT_GREY, type, 21, 37);
+    ASSERT_TRUE(parent && dest);
+    reference::fill_noise<T>(parent, 5);
+    Plx_Image src{};
+    ASSERT_TRUE(plx_image_extract_q(parent, {3, 1, 37, 21}, PLX_FORMAT_NONE, PLX_TYPE_NONE, 0, &src));
+    std::vector<T> k(taps.begin(), taps.end());
+    Plx_Mask1D mask{type, uint32_t(k.size()), k.data()};
+    ASSERT_TRUE(along_y ? plx_image_convolve1Dy_q(&src, -1, PLX_EDGE_EXTEND, &mask, dest)
+                        : plx_image_convolve1Dx_q(&src, -1, PLX_EDGE_EXTEND, &mask, dest));
+    const int r = int(k.size() / 2);
+    const bool sym = std::equal(k.begin(), k.end(), k.rbegin());
+    std::vector<T> lanes(k.size() * W), out(W);
+    std::vector<const T *> rows(k.size());
+    for (int y = 0; y < 21; ++y)
+        for (int x = 0; x < 37; ++x) {
+            for (int t = 0; t < int(k.size()); ++t) {
+                const int yy = along_y ? std::clamp(y + t - r, 0, 20) : y, xx = along_y ? x : std::clamp(x + t - r, 0, 36);
+                std::fill(lanes.begin() + t * W, lanes.begin() + (t + 1) * W, *reference::at<T>(&src, yy, xx, 0));
+                rows[t] = lanes.data() + t * W;
+            }
+            if (sym)
+                plx::conv::taps<T, true>(plx::conv::Isa::baseline, out.data(), rows.data(), k.data(), uint32_t(k.size()), W);
+            else
+                plx::conv::taps<T, false>(plx::conv::Isa::baseline, out.data(), rows.data(), k.data(), uint32_t(k.size()), W);
+            ASSERT_EQ(std::memcmp(reference::at<T>(dest, y, x, 0), out.data(), sizeof(T)), 0) << y << " " << x << (along_y ? " along y" : " along x");
+        }
+    plx_image_free(&src);
+    plx_image_free(parent);
+    plx_image_free(dest);
+}
+
+TEST(ConvolveKernels, LibraryGivesTheBaselineBits)
+{
+    const std::vector<double> gauss = {0.054, 0.242, 0.399, 0.242, 0.054};
+    const std::vector<double> skew = {0.3, -0.2, 0.9, 0.15, 0.05, -0.1, 0.7};
+    for (const auto &taps : {gauss, skew})
+        for (bool along_y : {false, true}) {
+            expect_baseline_bits<float>(taps, along_y);
+            expect_baseline_bits<double>(taps, along_y);
+        }
 }
