@@ -3,15 +3,13 @@
 #define PELLUX_SRC_CAMERA_INTERNAL_HPP
 
 #include "pellux/camera.h"
+#include "pellux/detail/precision.hpp"
 
 namespace plx {
 
 template <class T> struct CameraTraits;
 
-template <> struct CameraTraits<double> {
-    using Camera = Plx_Camera;
-    using Vec3 = Plx_Vector3;
-    using Mat22 = Plx_Matrix22;
+template <> struct CameraTraits<double> : Precision<double> {
     // Newton steps stop below this, relative to 1 + |x| + |y| in normalised units.
     static constexpr double tolerance = 1e-12;
     static constexpr const char *project_name = "plx_camera_point_project";
@@ -22,10 +20,7 @@ template <> struct CameraTraits<double> {
     static constexpr const char *line_backproject_name = "plx_camera_line_backproject";
 };
 
-template <> struct CameraTraits<float> {
-    using Camera = Plx_Camera_f;
-    using Vec3 = Plx_Vector3_f;
-    using Mat22 = Plx_Matrix22_f;
+template <> struct CameraTraits<float> : Precision<float> {
     static constexpr float tolerance = 1e-6f;
     static constexpr const char *project_name = "plx_cameraf_point_project";
     static constexpr const char *backproject_name = "plx_cameraf_point_backproject";

@@ -4,24 +4,13 @@
 #include <cstring>
 
 #include "common/internal.hpp"
+#include "pellux/detail/precision.hpp"
 #include "image/projective_warp_internal.hpp"
 
 namespace {
 
 template <class S>
-struct Precision;
-template <>
-struct Precision<double> {
-    using Camera = Plx_Camera;
-    using Vec3 = Plx_Vector3;
-    using Mat33 = Plx_Matrix33;
-};
-template <>
-struct Precision<float> {
-    using Camera = Plx_Camera_f;
-    using Vec3 = Plx_Vector3_f;
-    using Mat33 = Plx_Matrix33_f;
-};
+using Precision = plx::Precision<S>;
 
 // Reports a failure into the caller's slot when one is given, else into the trace.
 Plx_Bool report(int32_t *error_code, const char *name, int32_t code, const char *message)

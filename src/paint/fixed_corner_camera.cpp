@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "common/internal.hpp"
+#include "pellux/detail/precision.hpp"
 #include "paint/fixed_corner_warp.hpp"
 #include "plano/fixed_corner_camera.h"
 
@@ -16,19 +17,7 @@ using plano::fcw::Jac;
 using plano::fcw::Point;
 
 template <class S>
-struct Rec;
-template <>
-struct Rec<double> {
-    using Camera = Plx_Camera;
-    using Vec3 = Plx_Vector3;
-    using Mat22 = Plx_Matrix22;
-};
-template <>
-struct Rec<float> {
-    using Camera = Plx_Camera_f;
-    using Vec3 = Plx_Vector3_f;
-    using Mat22 = Plx_Matrix22_f;
-};
+using Rec = plx::Precision<S>;
 template <class S>
 using CameraT = typename Rec<S>::Camera;
 template <class S>
