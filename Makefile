@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= 2
 PACKAGES = cmake g++ make libeigen3-dev libgtest-dev libbenchmark-dev
-PEER_PACKAGES = libopencv-dev
+PEER_PACKAGES = libopencv-dev libceres-dev
 
 .PHONY: setup build test demo bench sanitize clean
 

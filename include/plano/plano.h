@@ -9,5 +9,6 @@
 #include "plano/fixed_corner_camera.h"
 #include "plano/sumo.h"
 #include "plano/projective_warp.h"
+#include "plano/track.h"
 
 #endif
