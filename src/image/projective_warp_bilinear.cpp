@@ -3,9 +3,12 @@
 // nearest source pixel under the border rules.
 #include <array>
 #include <cmath>
+#include <cstring>
+#include <type_traits>
 
 #include "common/internal.hpp"
 #include "image/projective_warp_internal.hpp"
+#include "image/projective_warp_bilinear_u8.hpp"
 
 namespace plano::warp {
 
@@ -171,7 +174,26 @@ void bilinear_row(Context &ctx, int32_t, RowBuffers &rb)
     const float *px = rb.px, *py = rb.py;
     uint8_t *st = rb.status;
     float *out = rb.pixels;
+    // 8-bit sources without a mask: runs of eight pixels to be written whose neighbourhoods
+    // are all inside go through the vector kernel (same arithmetic as the loop below).
+    bool (*vector8)(const U8Block &, const float *, const float *, float *) = nullptr;
+    if constexpr (std::is_same_v<T, uint8_t> && (C == 1 || C == 3 || C == 4)) {
+        if (mask == nullptr && u8_bilinear_vector_available() && int64_t(h) * src->stride < (int64_t(1) << 31))
+            vector8 = C == 1 ? u8_bilinear8_c1 : C == 3 ? u8_bilinear8_c3 : u8_bilinear8_c4;
+    }
+    const U8Block block{static_cast<const uint8_t *>(src->data), src->stride, last_x, last_y};
+    int32_t vector_end = -1;  // pixels below it were blended by the vector kernel
     for (int32_t i = 0; i < n; ++i) {
+        if (vector8 != nullptr && i >= vector_end && i + 8 <= n) {
+            uint64_t run;
+            std::memcpy(&run, st + i, 8);
+            if (run == 0x0101010101010101ull * kWrite && vector8(block, px + i, py + i, out + std::ptrdiff_t(i) * C)) {
+                vector_end = i + 8;
+                i += 7;
+                continue;
+            }
+            vector_end = i + 8;  // this run goes pixel by pixel
+        }
         if (st[i] != kWrite) continue;
         const float x = px[i], y = py[i];
         // The last row and column are never the top-left of a neighbourhood.
@@ -187,9 +209,14 @@ void bilinear_row(Context &ctx, int32_t, RowBuffers &rb)
                 const auto *r1 = rows.row(iy + 1);
                 float *o = out + std::ptrdiff_t(i) * C;
                 float v[C];
-                for (int c = 0; c < C; ++c)
-                    v[c] = (w00 * rows.get(r0, ix, c) + w10 * rows.get(r0, ix + 1, c)) +
-                           (w01 * rows.get(r1, ix, c) + w11 * rows.get(r1, ix + 1, c));
+                for (int c = 0; c < C; ++c) {
+                    if constexpr (std::is_same_v<T, uint8_t>)
+                        v[c] = blend_u8(w00, w10, w01, w11, r0[ix * C + c], r0[(ix + 1) * C + c], r1[ix * C + c],
+                                        r1[(ix + 1) * C + c]);
+                    else
+                        v[c] = (w00 * rows.get(r0, ix, c) + w10 * rows.get(r0, ix + 1, c)) +
+                               (w01 * rows.get(r1, ix, c) + w11 * rows.get(r1, ix + 1, c));
+                }
                 for (int c = 0; c < C; ++c) o[c] = v[c];
                 continue;
             }

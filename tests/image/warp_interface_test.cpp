@@ -255,7 +255,8 @@ struct InterruptAfter {
 
 TEST(ProjectiveWarpHost, InterruptLeavesLaterRowsUnwrittenAndSucceeds)
 {
-    Image src = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 20);
+    // Wider than one column strip, so rows are cut across strips.
+    Image src = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 300);
     fill_texture(src.get());
     const Plx_Matrix33 I = translation(0, 0);
     InterruptAfter state;
@@ -270,20 +271,21 @@ TEST(ProjectiveWarpHost, InterruptLeavesLaterRowsUnwrittenAndSucceeds)
         vInitProjectiveWarpParams(&p);
         p.fast_render = fast;
         p.tile_size = 4;
-        Image out = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 20);
+        Image out = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 300);
         const double mark = -1.0;
         plx_image_fill_const(out.get(), &mark);
         ASSERT_TRUE(warp(src.get(), out.get(), &I, &p, nullptr, nullptr, nullptr, nullptr, nullptr, &host));
-        // The interrupt is asked after each band of 16 rows (after each row of 4-row tiles
-        // when fast): the third answer stops the warp after 48 (12) rows.
-        const int32_t written = fast ? 12 : 48;
+        // The interrupt is asked after each row (after each row of 4-row tiles when fast):
+        // the third answer stops the warp after 3 (12) whole rows.
+        const int32_t written = fast ? 12 : 3;
         for (int32_t r = 0; r < 200; ++r)
-            EXPECT_EQ(pixel(out.get(), r, 5)[0] != -1.0, r < written) << fast << " row " << r;
+            for (int32_t c : {5, 150, 298})  // the last column has no bilinear neighbourhood
+                EXPECT_EQ(pixel(out.get(), r, c)[0] != -1.0, r < written) << fast << " row " << r << " col " << c;
     }
     // Progress: the first row reports 0; a full run passes 50%.
     state.calls = 0;
     state.answer_at = 1 << 30;
-    Image out = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 20);
+    Image out = make(PLX_FORMAT_GREY, PLX_TYPE_FLOAT, 200, 300);
     ASSERT_TRUE(warp(src.get(), out.get(), &I, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, &host));
     EXPECT_EQ(state.last_progress, 75);  // rows 0, 50, 100, 150 of 200
 }
