@@ -141,7 +141,8 @@ inline void fixed_taps_sse2(uint16_t *out, const uint16_t *const *src, const uin
 // out[i] = sum_t k[t] * src[t][i] for i < n, n a multiple of the vector width. With Sym the
 // mask is symmetric (k[t] == k[ntaps-1-t]) and mirrored taps are added before one multiply.
 // Per lane the order is fixed: taps from the outside in, the centre last.
-template <class A, bool Sym>
+// Stream (float, AVX2 only): out is 32-byte aligned and written with non-temporal stores.
+template <class A, bool Sym, bool Stream = false>
 [[gnu::always_inline]] inline void float_taps(A *out, const A *const *src, const A *k, uint32_t ntaps,
                                               std::size_t n)
 {
@@ -182,10 +183,17 @@ template <class A, bool Sym>
             a2 += kt * x2;
             a3 += kt * x3;
         }
+        if constexpr (Stream) {
+            __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i), reinterpret_cast<__v8sf>(a0));
+            __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + W), reinterpret_cast<__v8sf>(a1));
+            __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + 2 * W), reinterpret_cast<__v8sf>(a2));
+            __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + 3 * W), reinterpret_cast<__v8sf>(a3));
+        } else {
         std::memcpy(out + i, &a0, sizeof a0);
         std::memcpy(out + i + W, &a1, sizeof a1);
         std::memcpy(out + i + 2 * W, &a2, sizeof a2);
         std::memcpy(out + i + 3 * W, &a3, sizeof a3);
+        }
     }
     for (; i + W <= n; i += W) {
         V a0 = {}, x0, y0;
@@ -223,14 +231,22 @@ template <class A, bool Sym>
 }
 
 #ifdef PLX_CONV_X86
-template <class A, bool Sym>
+// Stream: float results go straight to memory (non-temporal stores) when out is aligned, for
+// outputs that are not read again soon; the values are the same.
+template <class A, bool Sym, bool Stream = false>
 [[gnu::target("avx2"), gnu::optimize("fp-contract=off")]] void taps_avx2(A *out, const A *const *src, const A *k,
                                                                          uint32_t ntaps, std::size_t n)
 {
-    if constexpr (std::is_same_v<A, uint16_t>)
+    if constexpr (std::is_same_v<A, uint16_t>) {
         fixed_taps_avx2(out, src, k, ntaps, n);
-    else
+    } else if constexpr (Stream && std::is_same_v<A, float>) {
+        if ((reinterpret_cast<uintptr_t>(out) & 31) == 0)
+            float_taps<A, Sym, true>(out, src, k, ntaps, n);
+        else
+            float_taps<A, Sym>(out, src, k, ntaps, n);
+    } else {
         float_taps<A, Sym>(out, src, k, ntaps, n);
+    }
 }
 
 inline bool cpu_has_avx2()

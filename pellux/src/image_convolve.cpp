@@ -31,12 +31,12 @@ namespace {
 using plx::conv::Isa;
 using plx::conv::Lanes;
 
-template <class A, bool Sym, Isa I>
+template <class A, bool Sym, Isa I, bool Stream = false>
 PLX_INLINE void taps_run(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
 {
 #ifdef PLX_CONV_X86
     if constexpr (I == Isa::avx2) {
-        plx::conv::taps_avx2<A, Sym>(out, src, k, ntaps, n);
+        plx::conv::taps_avx2<A, Sym, Stream>(out, src, k, ntaps, n);
         return;
     }
 #endif
@@ -50,7 +50,7 @@ struct Scratch {
     A *line;            // along x: the padded source line
     A *out;             // one output line before conversion
     A *stage;           // ntaps + 1 vectors for a ragged tail
-    const A **src;      // ntaps source pointers
+    const A **src;      // ntaps source pointers (along x: 2 ntaps, the second half for rows read in place)
     const A **stage_src;
     A *ring;            // along y: converted source rows
     int64_t *ring_row;  // the source row held by each ring slot
@@ -59,13 +59,13 @@ struct Scratch {
 };
 
 // The kernel over any n: whole vectors in place, the tail staged through one full vector.
-template <class A, bool Sym, Isa I>
+template <class A, bool Sym, Isa I, bool Stream = false>
 PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n,
                            const Scratch<A> &s)
 {
     constexpr std::size_t W = Lanes<A>::W;
     const std::size_t whole = n - n % W;
-    taps_run<A, Sym, I>(out, src, s.k, ntaps, whole);
+    taps_run<A, Sym, I, Stream>(out, src, s.k, ntaps, whole);
     if (whole == n) return;
     const std::size_t rest = n - whole;
     for (uint32_t t = 0; t < ntaps; ++t) {
@@ -190,6 +190,31 @@ PLX_INLINE void pass_x(const Pass &p, const Scratch<A> &s)
     const bool direct = std::is_same_v<T, A> && lanes == p.step;
     for (uint32_t t = 0; t < p.ntaps; ++t) s.src[t] = s.line + std::size_t(t) * lanes;
     A *inner = s.line + std::size_t(r) * lanes;
+    // Rows the kernel may read in place: outputs whose taps all lie inside the row come
+    // straight from it, and only the r pixels at each end go through a padded line. Every
+    // value gets the same arithmetic either way.
+    if (direct && w > 4 * r) {
+        const std::size_t edge = std::size_t(r) * lanes;  // values of r pixels
+        const A **row_src = s.src + p.ntaps;
+        for (int64_t y = 0; y < p.source->height; ++y) {
+            const A *row = reinterpret_cast<const A *>(row_of<T>(p.source, y, p.offset));
+            A *o = reinterpret_cast<A *>(row_of<T>(p.dest, y, p.offset));
+            for (uint32_t t = 0; t < p.ntaps; ++t) row_src[t] = row + std::size_t(t) * lanes;
+            apply_taps<A, Sym, I>(o + edge, row_src, p.ntaps, n - 2 * edge, s);
+            // The ends: the line holds pixels -r .. 2r - 1, then w - 2r .. w + r - 1.
+            for (int end = 0; end < 2; ++end) {
+                const int64_t first = end == 0 ? -r : w - 2 * r;
+                for (int64_t q = 0; q < 3 * r; ++q) {
+                    const int64_t m = edge_index(first + q, w, p.edge);
+                    for (std::size_t c = 0; c < lanes; ++c)
+                        s.line[std::size_t(q) * lanes + c] = m < 0 ? A(0) : row[std::size_t(m) * lanes + c];
+                }
+                apply_taps<A, Sym, I>(s.out, s.src, p.ntaps, edge, s);
+                std::memcpy(o + (end == 0 ? 0 : n - edge), s.out, edge * sizeof(A));
+            }
+        }
+        return;
+    }
     for (int64_t y = 0; y < p.source->height; ++y) {
         load_line<T, A>(row_of<T>(p.source, y, p.offset), std::size_t(w), lanes, p.step, inner);
         for (int64_t q = -r; q < 0; ++q) {
@@ -221,6 +246,7 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
     const bool direct = std::is_same_v<T, A> && lanes == p.step;
     const std::size_t row_bytes = std::size_t(w) * p.step * sizeof(T);
     constexpr int64_t kAhead = 16;
+    const bool streamed = direct && std::is_same_v<A, float> && I == Isa::avx2;
     for (uint32_t j = 0; j < s.ring_rows; ++j) s.ring_row[j] = -1;
     for (int64_t y = 0; y < h; ++y) {
         // Rows of a narrow column band lie a whole stride apart, which the hardware does not
@@ -229,7 +255,8 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
             const char *ahead = reinterpret_cast<const char *>(row_of<T>(p.source, y + r + kAhead, 0));
             for (std::size_t b = 0; b < row_bytes; b += 64) __builtin_prefetch(ahead + b);
         }
-        if (y + kAhead < h) {
+        // Streamed rows (float on AVX2) bypass the cache, so only the others are fetched early.
+        if (!streamed && y + kAhead < h) {
             char *ahead = reinterpret_cast<char *>(row_of<T>(p.dest, y + kAhead, 0));
             for (std::size_t b = 0; b < row_bytes; b += 64) __builtin_prefetch(ahead + b, 1);
         }
@@ -253,12 +280,15 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
         }
         T *o = row_of<T>(p.dest, y, p.offset);
         if (direct) {
-            apply_taps<A, Sym, I>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+            apply_taps<A, Sym, I, true>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
         } else {
             apply_taps<A, Sym, I>(s.out, s.src, p.ntaps, n, s);
             store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
         }
     }
+#ifdef PLX_CONV_X86
+    if constexpr (I == Isa::avx2) _mm_sfence();  // order the streamed rows before the pass returns
+#endif
 }
 
 template <class T, class A, bool Sym, bool AlongY, Isa I>
@@ -353,7 +383,7 @@ bool convolve_typed(Pass &p, const Plx_Mask1D *mask, const char *function)
         AlongY ? 0 : piece<A>((w + 2 * r) * p.lanes),
         piece<A>(n),
         piece<A>((ntaps + 1) * W),
-        piece<const A *>(ntaps),
+        piece<const A *>(AlongY ? ntaps : 2 * ntaps),  // along x: the line's taps, then the row's
         piece<const A *>(ntaps),
         AlongY ? piece<A>(std::size_t(ring_rows) * n) : 0,
         piece<int64_t>(ring_rows),
