@@ -246,7 +246,12 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
     const bool direct = std::is_same_v<T, A> && lanes == p.step;
     const std::size_t row_bytes = std::size_t(w) * p.step * sizeof(T);
     constexpr int64_t kAhead = 16;
-    const bool streamed = direct && std::is_same_v<A, float> && I == Isa::avx2;
+    // Large float outputs are streamed to memory: they cannot stay in cache anyway, and
+    // skipping the read-for-ownership of every line saves a third of the traffic. Small ones
+    // (tracker windows, pyramid levels) stay cached for whoever reads them next.
+    constexpr std::size_t kStreamBytes = std::size_t(4) << 20;
+    const bool streamed = direct && std::is_same_v<A, float> && I == Isa::avx2 &&
+                          std::size_t(p.dest->height) * std::size_t(std::abs(p.dest->stride)) >= kStreamBytes;
     for (uint32_t j = 0; j < s.ring_rows; ++j) s.ring_row[j] = -1;
     for (int64_t y = 0; y < h; ++y) {
         // Rows of a narrow column band lie a whole stride apart, which the hardware does not
@@ -279,15 +284,17 @@ PLX_INLINE void pass_y(const Pass &p, const Scratch<A> &s)
             }
         }
         T *o = row_of<T>(p.dest, y, p.offset);
-        if (direct) {
+        if (streamed) {
             apply_taps<A, Sym, I, true>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
+        } else if (direct) {
+            apply_taps<A, Sym, I>(reinterpret_cast<A *>(o), s.src, p.ntaps, n, s);
         } else {
             apply_taps<A, Sym, I>(s.out, s.src, p.ntaps, n, s);
             store_line<T, A>(s.out, std::size_t(w), lanes, p.step, o);
         }
     }
 #ifdef PLX_CONV_X86
-    if constexpr (I == Isa::avx2) _mm_sfence();  // order the streamed rows before the pass returns
+    if (streamed) _mm_sfence();  // the streamed rows are visible before the pass returns
 #endif
 }
 
