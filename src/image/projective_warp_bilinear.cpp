@@ -8,7 +8,7 @@
 
 #include "common/internal.hpp"
 #include "image/projective_warp_internal.hpp"
-#include "image/projective_warp_bilinear_u8.hpp"
+#include "image/projective_warp_bilinear_simd.hpp"
 
 namespace plano::warp {
 
@@ -174,14 +174,18 @@ void bilinear_row(Context &ctx, int32_t, RowBuffers &rb)
     const float *px = rb.px, *py = rb.py;
     uint8_t *st = rb.status;
     float *out = rb.pixels;
-    // 8-bit sources without a mask: runs of eight pixels to be written whose neighbourhoods
+    // 8-bit and one-channel float sources without a mask: runs of eight pixels to be written whose neighbourhoods
     // are all inside go through the vector kernel (same arithmetic as the loop below).
-    bool (*vector8)(const U8Block &, const float *, const float *, float *) = nullptr;
+    bool (*vector8)(const SourceBlock &, const float *, const float *, float *) = nullptr;
+    const bool vector_ok = mask == nullptr && u8_bilinear_vector_available() && src->stride > 0 &&
+                           int64_t(h) * src->stride < (int64_t(1) << 31);
     if constexpr (std::is_same_v<T, uint8_t> && (C == 1 || C == 3 || C == 4)) {
-        if (mask == nullptr && u8_bilinear_vector_available() && int64_t(h) * src->stride < (int64_t(1) << 31))
-            vector8 = C == 1 ? u8_bilinear8_c1 : C == 3 ? u8_bilinear8_c3 : u8_bilinear8_c4;
+        if (vector_ok) vector8 = C == 1 ? u8_bilinear8_c1 : C == 3 ? u8_bilinear8_c3 : u8_bilinear8_c4;
     }
-    const U8Block block{static_cast<const uint8_t *>(src->data), src->stride, last_x, last_y};
+    if constexpr (std::is_same_v<T, float> && C == 1) {
+        if (vector_ok) vector8 = f32_bilinear8_c1;
+    }
+    const SourceBlock block{static_cast<const uint8_t *>(src->data), src->stride, last_x, last_y};
     int32_t vector_end = -1;  // pixels below it were blended by the vector kernel
     for (int32_t i = 0; i < n; ++i) {
         if (vector8 != nullptr && i >= vector_end && i + 8 <= n) {

@@ -2,6 +2,7 @@
 // output's (through the working format, where colour correction acts), then written in the
 // output's pixel type.
 #include "image/projective_warp_internal.hpp"
+#include "image/projective_warp_bilinear_simd.hpp"
 
 namespace plano::warp {
 
@@ -47,7 +48,10 @@ void store_row(Plx_Image *output, int32_t row, int32_t col, int32_t n, const uin
     while (all < n && status[all] == kWrite) ++all;
     if (all == n) {
         // Every pixel written: one plain loop the compiler can vectorise.
-        for (int32_t k = 0; k < n * C; ++k) out[k] = store_value<T>(pixels[k]);
+        if constexpr (std::is_same_v<T, uint8_t>)
+            store_u8_run(pixels, out, std::size_t(n) * C);
+        else
+            for (int32_t k = 0; k < n * C; ++k) out[k] = store_value<T>(pixels[k]);
         return;
     }
     for (int32_t i = 0; i < n; ++i) {

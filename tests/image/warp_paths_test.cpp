@@ -283,19 +283,22 @@ TEST(ProjectiveWarpOptions, BackgroundIsCopiedAndGivesItsFrame)
 
 }  // namespace
 
-// 8-bit sources are blended eight pixels at a time where the machine allows; a source mask
-// (all set) sends every pixel through the one-at-a-time loop, which must give the same bits,
-// and both must match a plain bilinear sample to within rounding.
-TEST(ProjectiveWarpBilinear, EightBitRunsMatchPixelByPixelAndReference)
+// 8-bit and one-channel float sources are blended eight pixels at a time where the machine
+// allows; a source mask (all set) sends every pixel through the one-at-a-time loop, which must
+// give the same bits, and both must match a plain bilinear sample to within rounding.
+TEST(ProjectiveWarpBilinear, VectorRunsMatchPixelByPixelAndReference)
 {
     const double a = 0.3, s = 0.93;
     const Plx_Matrix33 H = matrix(s * std::cos(a), -s * std::sin(a), 20.0, s * std::sin(a), s * std::cos(a), -6.0,
                                   1e-4, -2e-4, 1.0);
-    for (Plx_ImageFormat f : {PLX_FORMAT_GREY, PLX_FORMAT_RGB, PLX_FORMAT_RGBA, PLX_FORMAT_BGR}) {
-        Image src = make(f, PLX_TYPE_UCHAR, 61, 83);
+    const std::pair<Plx_ImageFormat, Plx_PixelType> cases[] = {
+        {PLX_FORMAT_GREY, PLX_TYPE_UCHAR}, {PLX_FORMAT_RGB, PLX_TYPE_UCHAR}, {PLX_FORMAT_RGBA, PLX_TYPE_UCHAR},
+        {PLX_FORMAT_BGR, PLX_TYPE_UCHAR},  {PLX_FORMAT_GREY, PLX_TYPE_FLOAT}};
+    for (auto [f, t] : cases) {
+        Image src = make(f, t, 61, 83);
         fill_texture(src.get());
         Image mask = make_bits(61, 83, true);
-        Image plain = make(f, PLX_TYPE_UCHAR, 61, 83), masked = make(f, PLX_TYPE_UCHAR, 61, 83);
+        Image plain = make(f, t, 61, 83), masked = make(f, t, 61, 83);
         plx_image_fill_zero(plain.get());
         plx_image_fill_zero(masked.get());
         ASSERT_TRUE(warp(src.get(), plain.get(), &H));
@@ -310,9 +313,13 @@ TEST(ProjectiveWarpBilinear, EightBitRunsMatchPixelByPixelAndReference)
                 const double sy = (H.m[1][0] * X + H.m[1][1] * Y + H.m[1][2]) / w - 0.5;
                 if (!(sx > 0.01 && sx < 83 - 1.01 && sy > 0.01 && sy < 61 - 1.01)) continue;
                 ++checked;
-                for (int c = 0; c < channels; ++c)
-                    ASSERT_NEAR(pixel(plain.get(), y, x)[c], std::round(reference_sample(src.get(), sx, sy, c)), 1.0)
-                        << f << " " << x << "," << y;
+                for (int c = 0; c < channels; ++c) {
+                    const double want = reference_sample(src.get(), sx, sy, c);
+                    if (t == PLX_TYPE_UCHAR)
+                        ASSERT_NEAR(pixel(plain.get(), y, x)[c], std::round(want), 1.0) << f << " " << x << "," << y;
+                    else
+                        ASSERT_NEAR(pixel(plain.get(), y, x)[c], want, 2e-3 * full_scale(t)) << x << "," << y;
+                }
             }
         EXPECT_GT(checked, 2500);
     }
