@@ -1,7 +1,7 @@
 // Bilinear blending of 8-bit and one-channel float pixels, eight output pixels at a time with
-// AVX2 where the machine
-// has it. Both forms do the same single-precision operations in the same order on the raw
-// levels and scale by 1/255 last, so a warp gives the same bits on every machine.
+// AVX2 where the machine has it. Both forms do the same single-precision operations in the
+// same order (8-bit: on the raw levels, scaled by 1/255 last), so a warp gives the same bits
+// on every machine.
 #ifndef PLANO_SRC_IMAGE_PROJECTIVE_WARP_BILINEAR_SIMD_HPP
 #define PLANO_SRC_IMAGE_PROJECTIVE_WARP_BILINEAR_SIMD_HPP
 
