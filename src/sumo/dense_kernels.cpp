@@ -102,6 +102,147 @@ void add_atb(double alpha, const double *A, const double *B, uint32_t k, uint32_
     }
 }
 
+namespace {
+
+// Largest block the dynamic kernels sum on the stack; larger ones add term by term.
+constexpr uint32_t kLocal = 256;
+
+template <uint32_t N, uint32_t M>
+void atb_fixed(double alpha, const double *A, const double *B, uint32_t k, double *C)
+{
+    double t[N * M] = {};
+    for (uint32_t r = 0; r < k; ++r) {
+        const double *ar = A + std::size_t(r) * N;
+        const double *br = B + std::size_t(r) * M;
+        for (uint32_t i = 0; i < N; ++i) {
+            const double a = ar[i];
+            for (uint32_t j = 0; j < M; ++j) t[i * M + j] += a * br[j];
+        }
+    }
+    for (uint32_t i = 0; i < N * M; ++i) C[i] += alpha * t[i];
+}
+
+void atb_dynamic(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, uint32_t m, double *C)
+{
+    if (n * m > kLocal) {
+        add_atb(alpha, A, B, k, n, m, C);
+        return;
+    }
+    double t[kLocal];
+    std::memset(t, 0, sizeof(double) * n * m);
+    for (uint32_t r = 0; r < k; ++r) {
+        const double *ar = A + std::size_t(r) * n;
+        const double *br = B + std::size_t(r) * m;
+        for (uint32_t i = 0; i < n; ++i) {
+            const double a = ar[i];
+            for (uint32_t j = 0; j < m; ++j) t[i * m + j] += a * br[j];
+        }
+    }
+    for (uint32_t i = 0; i < n * m; ++i) C[i] += alpha * t[i];
+}
+
+template <uint32_t N>
+void atb_cols(double alpha, const double *A, const double *B, uint32_t k, uint32_t m, double *C)
+{
+    switch (m) {
+    case 1: return atb_fixed<N, 1>(alpha, A, B, k, C);
+    case 2: return atb_fixed<N, 2>(alpha, A, B, k, C);
+    case 3: return atb_fixed<N, 3>(alpha, A, B, k, C);
+    case 4: return atb_fixed<N, 4>(alpha, A, B, k, C);
+    case 6: return atb_fixed<N, 6>(alpha, A, B, k, C);
+    case 8: return atb_fixed<N, 8>(alpha, A, B, k, C);
+    case 9: return atb_fixed<N, 9>(alpha, A, B, k, C);
+    default: return atb_dynamic(alpha, A, B, k, N, m, C);
+    }
+}
+
+// Lower triangle of A^T B summed locally, then added to both triangles of C.
+template <uint32_t N>
+void atb_sym_fixed(double alpha, const double *A, const double *B, uint32_t k, double *C)
+{
+    // The full square vectorises better than the triangle; only the lower half is used.
+    double t[N * N] = {};
+    for (uint32_t r = 0; r < k; ++r) {
+        const double *ar = A + std::size_t(r) * N;
+        const double *br = B + std::size_t(r) * N;
+        for (uint32_t i = 0; i < N; ++i) {
+            const double a = ar[i];
+            for (uint32_t j = 0; j < N; ++j) t[i * N + j] += a * br[j];
+        }
+    }
+    for (uint32_t i = 0; i < N; ++i) {
+        for (uint32_t j = 0; j < i; ++j) {
+            const double v = alpha * t[i * N + j];
+            C[i * N + j] += v;
+            C[j * N + i] += v;
+        }
+        C[i * N + i] += alpha * t[i * N + i];
+    }
+}
+
+void atb_sym_dynamic(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, double *C)
+{
+    if (n * n > kLocal) {
+        // Large blocks: each entry of the lower triangle summed on its own.
+        for (uint32_t i = 0; i < n; ++i)
+            for (uint32_t j = 0; j <= i; ++j) {
+                double t = 0.0;
+                for (uint32_t r = 0; r < k; ++r) t += A[std::size_t(r) * n + i] * B[std::size_t(r) * n + j];
+                C[std::size_t(i) * n + j] += alpha * t;
+                if (j < i) C[std::size_t(j) * n + i] += alpha * t;
+            }
+        return;
+    }
+    double t[kLocal];
+    std::memset(t, 0, sizeof(double) * n * n);
+    for (uint32_t r = 0; r < k; ++r) {
+        const double *ar = A + std::size_t(r) * n;
+        const double *br = B + std::size_t(r) * n;
+        for (uint32_t i = 0; i < n; ++i) {
+            const double a = ar[i];
+            for (uint32_t j = 0; j <= i; ++j) t[i * n + j] += a * br[j];
+        }
+    }
+    for (uint32_t i = 0; i < n; ++i) {
+        for (uint32_t j = 0; j < i; ++j) {
+            const double v = alpha * t[i * n + j];
+            C[i * n + j] += v;
+            C[j * n + i] += v;
+        }
+        C[i * n + i] += alpha * t[i * n + i];
+    }
+}
+
+}  // namespace
+
+void add_atb_block(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, uint32_t m, double *C)
+{
+    switch (n) {
+    case 1: return atb_cols<1>(alpha, A, B, k, m, C);
+    case 2: return atb_cols<2>(alpha, A, B, k, m, C);
+    case 3: return atb_cols<3>(alpha, A, B, k, m, C);
+    case 4: return atb_cols<4>(alpha, A, B, k, m, C);
+    case 6: return atb_cols<6>(alpha, A, B, k, m, C);
+    case 8: return atb_cols<8>(alpha, A, B, k, m, C);
+    case 9: return atb_cols<9>(alpha, A, B, k, m, C);
+    default: return atb_dynamic(alpha, A, B, k, n, m, C);
+    }
+}
+
+void add_atb_sym(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, double *C)
+{
+    switch (n) {
+    case 1: return atb_sym_fixed<1>(alpha, A, B, k, C);
+    case 2: return atb_sym_fixed<2>(alpha, A, B, k, C);
+    case 3: return atb_sym_fixed<3>(alpha, A, B, k, C);
+    case 4: return atb_sym_fixed<4>(alpha, A, B, k, C);
+    case 6: return atb_sym_fixed<6>(alpha, A, B, k, C);
+    case 8: return atb_sym_fixed<8>(alpha, A, B, k, C);
+    case 9: return atb_sym_fixed<9>(alpha, A, B, k, C);
+    default: return atb_sym_dynamic(alpha, A, B, k, n, C);
+    }
+}
+
 void add_ab(double alpha, const double *A, const double *B, uint32_t n, uint32_t k, uint32_t m, double *C)
 {
     for (uint32_t i = 0; i < n; ++i) {

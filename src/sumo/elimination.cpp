@@ -163,6 +163,7 @@ void init_elim_state_covariance(Sumo *sumo, SumoStateVector *target, bool covari
 {
     (void)target;
     for (SumoStateVector *e = sumo->elim_last; e != nullptr; e = e->next) {
+        if (e->next != nullptr) __builtin_prefetch(e->next->next);
         e->covariance_valid = 0;
         if (!covariance_mode) continue;
         for (SumoOffdiag *k = e->row_blocks; k != nullptr; k = k->row_next)
@@ -221,14 +222,8 @@ PLANO_API Plx_Bool bRecursiveEliminationStateRange(Sumo *sumo, SumoStateVector *
 {
     (void)lambda;
     (void)mode;
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, true, __func__, &scope)) return PLX_FALSE;
     return eliminate_scope(scope, sumo, solve, last, error_code, __func__) ? PLX_TRUE : PLX_FALSE;
 }
 
@@ -251,14 +246,8 @@ PLANO_API Plx_Bool bBackSubstitutionBranch(Sumo *sumo, SumoBranch *branch, SumoS
 PLANO_API Plx_Bool bBackSubstitutionStateRange(Sumo *sumo, SumoStateVector *first_state, SumoStateVector *last_state,
                                                SumoStateVector *target, uint32_t apply, uint32_t first, uint32_t last)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
     if (!back_substitute_scope(sumo, scope, target, apply, first, last)) {
         PLX_ERR_PASS();
         return PLX_FALSE;

@@ -13,10 +13,22 @@ namespace {
 bool is_h(const SumoObs *o) { return o->kind == SUMO_OBS_H || o->kind == SUMO_OBS_H_ROBUST; }
 bool is_robust(const SumoObs *o) { return o->kind == SUMO_OBS_H_ROBUST || o->kind == SUMO_OBS_F_ROBUST; }
 
+// Resizing rewrites the record's sizes; jobs evaluate thousands of observations of one
+// shape, so the records are only touched when the shape changes.
+bool fit_vec(Plx_Vector *v, uint32_t n) { return v->rows == n || plx_vec_resize(v, n); }
+bool fit_mat(Plx_Matrix *M, uint32_t rows, uint32_t cols)
+{
+    return (M->rows == rows && M->cols == cols) || plx_mat_resize(M, rows, cols);
+}
+bool fit_squ(Plx_SquMatrix *A, Plx_SquMatrixType type, uint32_t n)
+{
+    return (A->type == type && A->size == n) || plx_squmat_resize(A, type, n);
+}
+
 bool call_function(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, Plx_Vector *out, Plx_Matrix **jac, Plx_Matrix *Fz)
 {
     const uint32_t m = o->z.v.rows;
-    if (!plx_vec_resize(out, m)) return false;
+    if (!fit_vec(out, m)) return false;
     if (is_h(o)) return o->func.h(sumo, ws, o->states, o->n_states, &o->z, out, jac) != 0;
     if (Fz != nullptr && !plx_mat_resize(Fz, m, m)) return false;
     return o->func.F(sumo, ws, o->states, o->n_states, &o->z, out, jac, Fz) != 0;
@@ -95,6 +107,17 @@ bool f_information(SumoWorkspace *ws, const SumoObs *o, uint32_t k)
     return true;
 }
 
+// Information matrices that are diagonal (or a scaled identity) stay diagonal in the
+// workspace (N_eff of type diagonal, k entries): the products with them are row scalings.
+bool diagonal_type(Plx_SquMatrixType t) { return t == PLX_SQUMAT_DIAGONAL || t == PLX_SQUMAT_SCALED_IDENTITY; }
+
+double quad_diag(const double *d, const double *r, uint32_t k)
+{
+    double q = 0.0;
+    for (uint32_t i = 0; i < k; ++i) q += r[i] * (d[i] * r[i]);
+    return q;
+}
+
 double quad(const double *N, const double *r, uint32_t k)
 {
     double q = 0.0;
@@ -132,7 +155,7 @@ bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool
         ws->jacobian_ptrs[i] = want ? &ws->jacobians[i] : nullptr;
         if (want) {
             any = true;
-            if (!plx_mat_resize(&ws->jacobians[i], m, dim(s))) return false;
+            if (!fit_mat(&ws->jacobians[i], m, dim(s))) return false;
             std::memset(ws->jacobians[i].data, 0, sizeof(double) * m * dim(s));
         }
     }
@@ -152,18 +175,22 @@ bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool
             return false;
         }
     }
-    if (is_h(o)) {
-        if (!plx_squmat_resize(&ws->N_eff, PLX_SQUMAT_SYMMETRIC, k)) return false;
+    if (is_h(o) && diagonal_type(o->N.type)) {
+        if (!fit_squ(&ws->N_eff, PLX_SQUMAT_DIAGONAL, k)) return false;
+        for (uint32_t r = 0; r < k; ++r) ws->N_eff.data[r] = o->N.data[o->N.type == PLX_SQUMAT_DIAGONAL ? r : 0];
+    } else if (is_h(o)) {
+        if (!fit_squ(&ws->N_eff, PLX_SQUMAT_SYMMETRIC, k)) return false;
         squ_dense(&o->N, ws->N_eff.data);
     } else if (!f_information(ws, o, k)) {
         return false;
     }
+    const bool diagonal = ws->N_eff.type == PLX_SQUMAT_DIAGONAL;
     *chi2 = 0.0;
     if (residual) {
-        if (!plx_vec_resize(&ws->residual, k)) return false;
+        if (!fit_vec(&ws->residual, k)) return false;
         for (uint32_t r = 0; r < k; ++r)
             ws->residual.data[r] = is_h(o) ? o->z.v.data[r] - ws->h.data[r] : -ws->h.data[r];
-        *chi2 = quad(ws->N_eff.data, ws->residual.data, k);
+        *chi2 = diagonal ? quad_diag(ws->N_eff.data, ws->residual.data, k) : quad(ws->N_eff.data, ws->residual.data, k);
         if (!std::isfinite(*chi2)) {
             PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_OUTSIDE_RANGE, "residual is not finite", 0);
             return false;
@@ -172,9 +199,17 @@ bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool
     }
     if (is_robust(o) && o->outlier) {
         const double inv = 1.0 / o->variance_scaling;
-        for (std::size_t i = 0; i < std::size_t(k) * k; ++i) ws->N_eff.data[i] *= inv;
+        const std::size_t stored = diagonal ? k : std::size_t(k) * k;
+        for (std::size_t i = 0; i < stored; ++i) ws->N_eff.data[i] *= inv;
     }
     return true;
+}
+
+// The cost of an evaluated observation from its chi-squared and decision.
+double cost_of(const SumoObs *o, double chi2)
+{
+    if (!is_robust(o) || !o->outlier) return chi2 * o->weight;
+    return (chi2 / o->variance_scaling + o->chi2_offset) * o->weight;
 }
 
 double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, const char *function)
@@ -185,13 +220,74 @@ double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, const char *function)
         return SUMO_FAILED_RESIDUAL;
     }
     // chi2 is always r^T N' r with the unscaled N'.
-    if (!is_robust(o)) return chi2 * o->weight;
-    if (chi2 <= o->chi2_cutoff) {
-        o->outlier = 0;
-        return chi2 * o->weight;
+    if (is_robust(o)) o->outlier = chi2 <= o->chi2_cutoff ? 0u : 1u;
+    return cost_of(o, chi2);
+}
+
+bool accumulate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *obs, uint32_t residual, uint32_t eliminate, uint32_t add,
+                    uint32_t first, uint32_t last, uint32_t thread, double *cost)
+{
+    double chi2;
+    if (!evaluate_obs(sumo, ws, obs, residual != 0, residual != 0, true, first, last, &chi2)) return false;
+    *cost = residual ? cost_of(obs, chi2) : 0.0;
+    const uint32_t k = ws->h.rows;
+    const bool diagonal = ws->N_eff.type == PLX_SQUMAT_DIAGONAL;
+    const double alpha = (add ? 1.0 : -1.0) * obs->weight;
+    // N' J_i for every state with a Jacobian.
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        const Plx_Matrix *J = ws->jacobian_ptrs[i];
+        if (J == nullptr) continue;
+        const uint32_t n = J->cols;
+        if (!fit_mat(&ws->nj[i], k, n)) return false;
+        double *nj = ws->nj[i].data;
+        if (diagonal) {
+            for (uint32_t r = 0; r < k; ++r) {
+                const double d = ws->N_eff.data[r];
+                for (uint32_t c = 0; c < n; ++c) nj[std::size_t(r) * n + c] = d * J->data[std::size_t(r) * n + c];
+            }
+        } else {
+            std::memset(nj, 0, sizeof(double) * k * n);
+            add_ab(1.0, ws->N_eff.data, J->data, k, k, n, nj);
+        }
     }
-    o->outlier = 1;
-    return (chi2 / o->variance_scaling + o->chi2_offset) * o->weight;
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        const Plx_Matrix *Ji = ws->jacobian_ptrs[i];
+        if (Ji == nullptr) continue;
+        SumoStateVector *s = obs->states[i];
+        const uint32_t n = Ji->cols;
+        double *A, *b;
+        if (eliminate) {
+            A = s->A.data;
+            b = s->b.data;
+        } else if (thread != SUMO_NOT_IN_THREAD) {
+            A = s->thread_blocks[thread].A.data;
+            b = s->thread_blocks[thread].b.data;
+        } else {
+            A = s->A_work.data;
+            b = s->b_work.data;
+        }
+        add_atb_sym(alpha, Ji->data, ws->nj[i].data, k, n, A);
+        if (residual) add_atv(alpha, ws->nj[i].data, ws->residual.data, k, n, b);
+        for (uint32_t j = i + 1; j < obs->n_states; ++j) {
+            const Plx_Matrix *Jj = ws->jacobian_ptrs[j];
+            if (Jj == nullptr) continue;
+            SumoOffdiag *blk;
+            bool i_row;
+            if (!block_between(sumo, s, obs->states[j], thread == SUMO_NOT_IN_THREAD, &blk, &i_row)) return false;
+            if (blk == nullptr) {
+                PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_NOT_INITIALISED,
+                                 "off-diagonal block not made before a threaded build", 0);
+                return false;
+            }
+            double *M = eliminate ? blk->M.data
+                                  : (thread != SUMO_NOT_IN_THREAD ? blk->thread_blocks[thread].data : blk->M_work.data);
+            if (i_row)
+                add_atb_block(alpha, Ji->data, ws->nj[j].data, k, n, Jj->cols, M);
+            else
+                add_atb_block(alpha, Jj->data, ws->nj[i].data, k, Jj->cols, n, M);
+        }
+    }
+    return true;
 }
 
 }  // namespace sumo
@@ -210,63 +306,10 @@ PLANO_API Plx_Bool bSumoObsEvaluate(Sumo *sumo, SumoWorkspace *workspace, SumoOb
         return PLX_FALSE;
     }
     if (thread == SUMO_NOT_IN_THREAD && !ensure_indices(sumo)) return PLX_FALSE;
-    double chi2;
-    if (!evaluate_obs(sumo, workspace, obs, residual != 0, residual != 0, true, first, last, &chi2)) {
+    double cost;
+    if (!accumulate_obs(sumo, workspace, obs, residual, eliminate, add, first, last, thread, &cost)) {
         PLX_ERR_PASS();
         return PLX_FALSE;
-    }
-    SumoWorkspace *ws = workspace;
-    const uint32_t k = ws->h.rows;
-    const double alpha = (add ? 1.0 : -1.0) * obs->weight;
-    // N' J_i for every state with a Jacobian.
-    for (uint32_t i = 0; i < obs->n_states; ++i) {
-        const Plx_Matrix *J = ws->jacobian_ptrs[i];
-        if (J == nullptr) continue;
-        if (!plx_mat_resize(&ws->nj[i], k, J->cols)) {
-            PLX_ERR_PASS();
-            return PLX_FALSE;
-        }
-        std::memset(ws->nj[i].data, 0, sizeof(double) * k * J->cols);
-        add_ab(1.0, ws->N_eff.data, J->data, k, k, J->cols, ws->nj[i].data);
-    }
-    for (uint32_t i = 0; i < obs->n_states; ++i) {
-        const Plx_Matrix *Ji = ws->jacobian_ptrs[i];
-        if (Ji == nullptr) continue;
-        SumoStateVector *s = obs->states[i];
-        const uint32_t n = Ji->cols;
-        double *A, *b;
-        if (eliminate) {
-            A = s->A.data;
-            b = s->b.data;
-        } else if (thread != SUMO_NOT_IN_THREAD) {
-            A = s->thread_blocks[thread].A.data;
-            b = s->thread_blocks[thread].b.data;
-        } else {
-            A = s->A_work.data;
-            b = s->b_work.data;
-        }
-        add_atb(alpha, Ji->data, ws->nj[i].data, k, n, n, A);
-        if (residual) add_atv(alpha, ws->nj[i].data, ws->residual.data, k, n, b);
-        for (uint32_t j = i + 1; j < obs->n_states; ++j) {
-            const Plx_Matrix *Jj = ws->jacobian_ptrs[j];
-            if (Jj == nullptr) continue;
-            SumoOffdiag *blk;
-            bool i_row;
-            if (!block_between(sumo, s, obs->states[j], thread == SUMO_NOT_IN_THREAD, &blk, &i_row)) {
-                PLX_ERR_PASS();
-                return PLX_FALSE;
-            }
-            if (blk == nullptr) {
-                PLX_ERR_START(PLX_ERROR_NOT_INITIALISED, "off-diagonal block not made before a threaded build", 0);
-                return PLX_FALSE;
-            }
-            double *M = eliminate ? blk->M.data
-                                  : (thread != SUMO_NOT_IN_THREAD ? blk->thread_blocks[thread].data : blk->M_work.data);
-            if (i_row)
-                add_atb(alpha, Ji->data, ws->nj[j].data, k, n, Jj->cols, M);
-            else
-                add_atb(alpha, Jj->data, ws->nj[i].data, k, Jj->cols, n, M);
-        }
     }
     return PLX_TRUE;
 }

@@ -1,6 +1,7 @@
 // Building the information of a branch or a run of states: reset the work copies to the
 // fixed prior, evaluate the observations (threaded through the host's pool), combine the
 // per-thread accumulators, and damp the diagonal.
+#include <algorithm>
 #include <vector>
 
 #include "common/job_batch.hpp"
@@ -12,25 +13,33 @@ namespace {
 
 bool in_last(const SumoStateVector *s, uint32_t last) { return last == kAll || s->index <= last; }
 
-// A chunk of the active list for the root build.
+// A chunk of the counted observations for the root build; with `cost`, the chunk's cost is
+// summed as it goes (in list order, as the total cost sums it).
 struct RootJob {
     Sumo *sumo;
     SumoWorkspace *ws;
-    SumoObs *start;
+    SumoObs *const *obs;
     uint32_t count;
     uint32_t thread;
     uint32_t residual;
+    bool cost;
+    double sum;
 };
 
 Plx_Bool root_job(void *argument)
 {
     auto *job = static_cast<RootJob *>(argument);
-    uint32_t done = 0;
-    for (SumoObs *o = job->start; o != nullptr && done < job->count; o = o->next) {
-        if (!obs_all_initialised(o)) continue;
-        ++done;
-        if (!bSumoObsEvaluate(job->sumo, job->ws, o, job->residual, 0, 1, kAll, kAll, job->thread)) return PLX_FALSE;
+    double sum = 0.0;
+    for (uint32_t i = 0; i < job->count; ++i) {
+        prefetch_obs(job->obs, i, job->count);
+        double c;
+        if (!accumulate_obs(job->sumo, job->ws, job->obs[i], job->residual, 0, 1, kAll, kAll, job->thread, &c)) {
+            plx_err_register_fileline("bSumoObsEvaluate", PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+            return PLX_FALSE;
+        }
+        if (job->cost) sum += c;
     }
+    job->sum = sum;
     return PLX_TRUE;
 }
 
@@ -68,44 +77,144 @@ bool run(const ThreadHostInterface *host, Plx_Bool (*fn)(void *), std::vector<Jo
     return true;
 }
 
-bool build_root(Sumo *sumo, uint32_t residual, const ThreadHostInterface *host, const char *function)
+bool threaded(const Sumo *sumo, const ThreadHostInterface *host) { return host != nullptr && sumo->n_threads > 0; }
+
+// Evaluates the observations of the scope owned by states with index in [own_first,
+// own_last], with Jacobians for [first, last]. Threaded, the owner range is cut into T
+// contiguous sub-ranges, job j taking own_first + floor(j L / T) .. own_first +
+// floor((j + 1) L / T) - 1 for L indices, into its own accumulators (the caller zeroes and
+// combines them); otherwise it runs here, straight into the work copies.
+bool evaluate_split(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t first, uint32_t last,
+                    uint32_t own_first, uint32_t own_last, const ThreadHostInterface *host, const char *function)
 {
-    Scope all;
-    all.branch = sumo->root;
+    if (!threaded(sumo, host)) {
+        SumoWorkspace *ws = job_workspaces(sumo, 1);
+        if (ws == nullptr ||
+            !evaluate_scope(sumo, ws, scope, residual, first, last, own_first, own_last, SUMO_NOT_IN_THREAD)) {
+            plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+            return false;
+        }
+        return true;
+    }
+    const uint32_t T = sumo->n_threads;
+    SumoWorkspace *ws = job_workspaces(sumo, T);
+    if (ws == nullptr) return false;
+    const uint64_t L = uint64_t(own_last) - own_first + 1;
+    std::vector<RangeJob> jobs(T);
+    for (uint32_t j = 0; j < T; ++j) {
+        const uint64_t lo = own_first + L * j / T, hi = own_first + L * (j + 1) / T;
+        jobs[j] = RangeJob{sumo, job_ws(ws, j), &scope, residual, first, last, uint32_t(lo), uint32_t(hi - 1), j};
+        // An empty sub-range is marked by own_first > own_last.
+        if (hi == lo) jobs[j].own_first = 1, jobs[j].own_last = 0;
+    }
+    return run(host, range_job, jobs, function);
+}
+
+// Zeroes (add false) or adds into the work copies (add true) the thread accumulators of every
+// active state of the model with index in [first, last] (first kAll: all) and of its blocks
+// to such states: every accumulator a threaded evaluation with those Jacobians can write.
+void gather_model(Sumo *sumo, uint32_t first, uint32_t last, bool add)
+{
+    const uint32_t T = sumo->n_threads;
+    auto in = [&](const SumoStateVector *s) {
+        return is_active(s) && (first == kAll || (s->index >= first && s->index <= last));
+    };
+    auto visit = [&](SumoStateVector *s) {
+        if (!in(s)) return true;
+        const uint32_t n = dim(s);
+        for (uint32_t t = 0; t < T; ++t) {
+            double *A = s->thread_blocks[t].A.data, *b = s->thread_blocks[t].b.data;
+            if (add) {
+                add_into(s->A_work.data, A, std::size_t(n) * n);
+                add_into(s->b_work.data, b, n);
+            } else {
+                std::memset(A, 0, sizeof(double) * n * n);
+                if (n > 0) std::memset(b, 0, sizeof(double) * n);
+            }
+        }
+        for (SumoOffdiag *k = s->row_blocks; k != nullptr; k = k->row_next) {
+            if (!in(k->col)) continue;
+            const std::size_t count = std::size_t(k->M.rows) * k->M.cols;
+            for (uint32_t t = 0; t < T; ++t) {
+                if (add)
+                    add_into(k->M_work.data, k->thread_blocks[t].data, count);
+                else if (count > 0)
+                    std::memset(k->thread_blocks[t].data, 0, sizeof(double) * count);
+            }
+        }
+        return true;
+    };
+    walk_branch(sumo->root, visit);
+}
+
+// The entry points' evaluation of a branch or run: every observation the scope owns within
+// [first, last] (first kAll: all of them, with every Jacobian), added to the work copies.
+bool evaluate_entry(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last, const ThreadHostInterface *host,
+                    const char *function)
+{
+    if (!ensure_indices(sumo) || !create_blocks_scope(sumo, scope, first, last)) {
+        plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+        return false;
+    }
+    // Owners: the scope's active states, within [first, last] when given.
+    uint32_t lo, hi;
+    if (scope.branch != nullptr)
+        bSumoGetIndexLimitsBranch(scope.branch, &lo, &hi);
+    else
+        bSumoGetIndexLimitsStateRange(scope.first, scope.last, &lo, &hi);
+    if (lo == kAll) return true;
+    if (first != kAll) {
+        lo = std::max(lo, first);
+        hi = std::min(hi, last);
+        if (hi < lo) return true;
+    }
+    if (!threaded(sumo, host)) return evaluate_split(sumo, scope, 1, first, last, lo, hi, host, function);
+    gather_model(sumo, first, last, false);
+    if (!evaluate_split(sumo, scope, 1, first, last, lo, hi, host, function)) return false;
+    gather_model(sumo, first, last, true);
+    return true;
+}
+
+// The root build: one pass over the active list collects the counted observations (every
+// state initialised) and makes their blocks; chunk j of T holds those numbered [jK/T,
+// (j+1)K/T). With `cost` (residual flag set), the total cost at the current parameters comes
+// out of the same evaluations, summed per chunk and then over the chunks in order, exactly
+// as dSumoComputeResidual sums it.
+bool build_root(Sumo *sumo, uint32_t residual, const ThreadHostInterface *host, const char *function, double *cost)
+{
+    const Scope all = Scope::of(sumo->root);
     if (!reset_scope(all, kAll, sumo->n_threads)) return false;
-    if (!create_blocks_scope(sumo, all, kAll, kAll)) {
+    std::vector<SumoObs *> counted;
+    if (!collect_counted(sumo, sumo->obs_active, true, counted)) {
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return false;
     }
     const uint32_t T = sumo->n_threads;
     SumoWorkspace *ws = job_workspaces(sumo, T == 0 ? 1 : T);
     if (ws == nullptr) return false;
+    const bool with_cost = cost != nullptr && residual != 0;
+    const uint64_t K = counted.size();
+    std::vector<RootJob> jobs(T == 0 ? 1 : T);
+    for (uint32_t j = 0; j < jobs.size(); ++j) {
+        const uint64_t begin = K * j / jobs.size(), end = K * (j + 1) / jobs.size();
+        jobs[j] = RootJob{sumo,     job_ws(ws, j), counted.data() + begin, uint32_t(end - begin),
+                          T == 0 ? SUMO_NOT_IN_THREAD : j, residual, with_cost, 0.0};
+    }
     if (T == 0) {
-        RootJob job{sumo, ws, sumo->obs_active, 0xFFFFFFFFu, SUMO_NOT_IN_THREAD, residual};
-        if (!root_job(&job)) {
+        if (!root_job(&jobs[0])) {
             plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
             return false;
         }
-        return true;
+    } else {
+        if (!run(host_for(host, K, kMinObsPerJob, T), root_job, jobs, function)) return false;
+        if (!combine_scope(all, kAll, 0, T)) return false;
     }
-    uint64_t K = 0;
-    for (SumoObs *o = sumo->obs_active; o != nullptr; o = o->next)
-        if (obs_all_initialised(o)) ++K;
-    std::vector<RootJob> jobs(T);
-    // Chunk j holds the counted observations numbered [jK/T, (j+1)K/T).
-    uint64_t counted = 0;
-    uint32_t j = 0;
-    SumoObs *o = sumo->obs_active;
-    for (; j < T; ++j) {
-        const uint64_t begin = K * j / T, end = K * (j + 1) / T;
-        while (o != nullptr && (!obs_all_initialised(o) || counted < begin)) {
-            if (obs_all_initialised(o)) ++counted;
-            o = o->next;
-        }
-        jobs[j] = RootJob{sumo, &ws[j], o, uint32_t(end - begin), j, residual};
+    if (with_cost) {
+        double sum = 0.0;
+        for (const RootJob &job : jobs) sum += job.sum;
+        *cost = sum;
     }
-    if (!run(host, root_job, jobs, function)) return false;
-    return combine_scope(all, kAll, 0, T);
+    return true;
 }
 
 }  // namespace
@@ -169,10 +278,10 @@ bool evaluate_scope(Sumo *sumo, SumoWorkspace *ws, const Scope &scope, uint32_t 
 }
 
 bool build_scope(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t first, uint32_t last,
-                 const ThreadHostInterface *host, const char *function)
+                 const ThreadHostInterface *host, const char *function, double *cost)
 {
     if (!ensure_indices(sumo)) return false;
-    if (scope.branch == sumo->root && first == kAll) return build_root(sumo, residual, host, function);
+    if (scope.branch == sumo->root && first == kAll) return build_root(sumo, residual, host, function, cost);
     if (first == kAll) {
         if (scope.branch == nullptr) {
             if (last != kAll) {
@@ -194,28 +303,8 @@ bool build_scope(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t fir
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return false;
     }
-    const uint32_t T = sumo->n_threads;
-    if (host == nullptr || T == 0) {
-        SumoWorkspace *ws = job_workspaces(sumo, 1);
-        if (ws == nullptr || !evaluate_scope(sumo, ws, scope, residual, first, last, first, last, SUMO_NOT_IN_THREAD)) {
-            plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
-            return false;
-        }
-        return true;
-    }
-    SumoWorkspace *ws = job_workspaces(sumo, T);
-    if (ws == nullptr) return false;
-    const uint64_t L = uint64_t(last) - first + 1;
-    std::vector<RangeJob> jobs(T);
-    for (uint32_t j = 0; j < T; ++j) {
-        const uint64_t lo = first + L * j / T, hi = first + L * (j + 1) / T;
-        // An empty sub-range is marked by own_first > own_last.
-        jobs[j] = RangeJob{sumo, &ws[j], &scope, residual, first, last, uint32_t(lo),
-                           hi > lo ? uint32_t(hi - 1) : 0u, j};
-        if (hi == lo) jobs[j].own_first = 1, jobs[j].own_last = 0;
-    }
-    if (!run(host, range_job, jobs, function)) return false;
-    return combine_scope(scope, last, 0, T);
+    if (!evaluate_split(sumo, scope, residual, first, last, first, last, host, function)) return false;
+    return !threaded(sumo, host) || combine_scope(scope, last, 0, sumo->n_threads);
 }
 
 }  // namespace sumo
@@ -238,58 +327,27 @@ PLANO_API Plx_Bool bSumoBuildInformationBlocksStateRange(Sumo *sumo, SumoStateVe
                                                          SumoStateVector *last_state, uint32_t first, uint32_t last,
                                                          const ThreadHostInterface *host)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
     return build_scope(sumo, scope, 1, first, last, host, __func__) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoEvaluateObsBranch(Sumo *sumo, SumoBranch *branch, uint32_t first, uint32_t last,
                                           const ThreadHostInterface *host)
 {
-    (void)host;
     if (sumo == nullptr || branch == nullptr) {
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    if (!ensure_indices(sumo)) return PLX_FALSE;
-    Scope scope;
-    scope.branch = branch;
-    SumoWorkspace *ws = job_workspaces(sumo, 1);
-    const uint32_t own_last = first == kAll ? kAll : last;
-    if (ws == nullptr || !create_blocks_scope(sumo, scope, first, last) ||
-        !evaluate_scope(sumo, ws, scope, 1, first, last, first == kAll ? 0 : first, own_last, SUMO_NOT_IN_THREAD)) {
-        PLX_ERR_PASS();
-        return PLX_FALSE;
-    }
-    return PLX_TRUE;
+    return evaluate_entry(sumo, Scope::of(branch), first, last, host, __func__) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoEvaluateObsStateRange(Sumo *sumo, SumoStateVector *first_state, SumoStateVector *last_state,
                                               uint32_t first, uint32_t last, const ThreadHostInterface *host)
 {
-    (void)host;
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
-    SumoWorkspace *ws = job_workspaces(sumo, 1);
-    const uint32_t own_last = first == kAll ? kAll : last;
-    if (ws == nullptr ||
-        !evaluate_scope(sumo, ws, scope, 1, first, last, first == kAll ? 0 : first, own_last, SUMO_NOT_IN_THREAD)) {
-        PLX_ERR_PASS();
-        return PLX_FALSE;
-    }
-    return PLX_TRUE;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
+    return evaluate_entry(sumo, scope, first, last, host, __func__) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoResetInfoBranch(Sumo *sumo, SumoBranch *branch, uint32_t last)
@@ -307,14 +365,8 @@ PLANO_API Plx_Bool bSumoResetInfoBranch(Sumo *sumo, SumoBranch *branch, uint32_t
 PLANO_API Plx_Bool bSumoResetInfoStateRange(Sumo *sumo, SumoStateVector *first_state, SumoStateVector *last_state,
                                             uint32_t last)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, true, __func__, &scope)) return PLX_FALSE;
     return reset_scope(scope, last, sumo->n_threads) ? PLX_TRUE : PLX_FALSE;
 }
 
@@ -332,14 +384,8 @@ PLANO_API Plx_Bool bSumoCombineThreadedInfoBranch(Sumo *sumo, SumoBranch *branch
 PLANO_API Plx_Bool bSumoCombineThreadedInfoStateRange(Sumo *sumo, SumoStateVector *first_state,
                                                       SumoStateVector *last_state, uint32_t last, uint32_t into_fixed)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
     return combine_scope(scope, last, into_fixed, sumo->n_threads) ? PLX_TRUE : PLX_FALSE;
 }
 
@@ -374,10 +420,8 @@ PLANO_API Plx_Bool bDampInformationMatrixBranch(SumoBranch *branch, double lambd
 PLANO_API Plx_Bool bDampInformationMatrixStateRange(SumoStateVector *first_state, SumoStateVector *last_state,
                                                     double lambda, uint32_t mode)
 {
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(first_state, last_state, __func__, &scope)) return PLX_FALSE;
     return scope.walk([&](SumoStateVector *s) { return bDampInformationMatrixState(s, lambda, mode) != 0; })
                ? PLX_TRUE
                : PLX_FALSE;

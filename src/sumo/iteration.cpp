@@ -31,12 +31,16 @@ PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch
         PLX_ERR_PASS();
         return PLX_FALSE;
     }
+    // The whole model's build evaluates every counted observation at the stored parameters
+    // with its residual, which is all the cost needs: a stale cost comes out of the build.
+    const bool stale = accepted != nullptr && (sumo->modified || sumo->cache_branch != branch);
+    const bool cost_from_build = stale && apply && branch == sumo->root && first == kAll;
     if (accepted == nullptr) {
         sumo->residual = 0.0;
         sumo->modified = 1;
         sumo->cache_first = sumo->cache_last = nullptr;
         sumo->cache_branch = nullptr;
-    } else if (sumo->modified || sumo->cache_branch != branch) {
+    } else if (stale && !cost_from_build) {
         const double c = residual_scope(sumo, scope, host, __func__);
         if (failed_cost(c)) {
             PLX_ERR_PASS();
@@ -47,9 +51,16 @@ PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch
         sumo->cache_branch = branch;
         sumo->cache_first = sumo->cache_last = nullptr;
     }
-    if (!build_scope(sumo, scope, apply, first, last, host, __func__)) {
+    double c0 = 0.0;
+    if (!build_scope(sumo, scope, apply, first, last, host, __func__, cost_from_build ? &c0 : nullptr)) {
         PLX_ERR_PASS();
         return PLX_FALSE;
+    }
+    if (cost_from_build) {
+        sumo->residual = c0;
+        sumo->modified = 0;
+        sumo->cache_branch = branch;
+        sumo->cache_first = sumo->cache_last = nullptr;
     }
     if (lambda != 0.0 && !bDampInformationMatrixBranch(branch, lambda, mode)) {
         PLX_ERR_PASS();
@@ -64,7 +75,9 @@ PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch
         return PLX_TRUE;  // not positive definite: the step is rejected, parameters untouched
     }
     sumo->covariance_done = 0;
-    init_elim_state_covariance(sumo, target, apply == 0);
+    // A step clears the eliminated states' covariances when it is rejected, or while it
+    // carries them along when it is accepted: one walk of that long list instead of two.
+    if (!apply) init_elim_state_covariance(sumo, target, true);
     if (!back_substitute_scope(sumo, scope, target, apply, first, last)) {
         PLX_ERR_PASS();
         return PLX_FALSE;
@@ -79,15 +92,18 @@ PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch
         return PLX_TRUE;
     }
     if (!increment_scope(sumo, scope, first, last)) {
+        init_elim_state_covariance(sumo, nullptr, false);
         PLX_ERR_PASS();
         return PLX_FALSE;
     }
     const double c1 = (accepted != nullptr || reduction != nullptr) ? residual_scope(sumo, scope, host, __func__) : 0.0;
     if (failed_cost(c1)) {
+        init_elim_state_covariance(sumo, nullptr, false);
         PLX_ERR_PASS();
         return PLX_FALSE;
     }
     if (accepted != nullptr && c1 >= sumo->residual) {
+        init_elim_state_covariance(sumo, nullptr, false);
         if (!reinstate_scope(sumo, scope)) {
             PLX_ERR_PASS();
             return PLX_FALSE;
@@ -112,16 +128,10 @@ PLANO_API Plx_Bool bSumoLevMarqIterationStateRange(Sumo *sumo, SumoStateVector *
                                                    uint32_t first, uint32_t last, uint32_t *accepted,
                                                    double *reduction, const ThreadHostInterface *host)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
     if (accepted != nullptr) *accepted = 0;
     if (reduction != nullptr) *reduction = 0.0;
-    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, true, __func__, &scope)) return PLX_FALSE;
     if (!build_scope(sumo, scope, 1, first, last, host, __func__)) {
         PLX_ERR_PASS();
         return PLX_FALSE;

@@ -14,6 +14,10 @@ bool pair_in(const SumoStateVector *s, uint32_t first, uint32_t last)
     return is_active(s) && dim(s) > 0 && (first == kAll || (s->index >= first && s->index <= last));
 }
 
+}  // namespace
+
+namespace sumo {
+
 bool create_obs_blocks(Sumo *sumo, const SumoObs *obs, uint32_t first, uint32_t last)
 {
     for (uint32_t i = 0; i < obs->n_states; ++i) {
@@ -30,10 +34,6 @@ bool create_obs_blocks(Sumo *sumo, const SumoObs *obs, uint32_t first, uint32_t 
     return true;
 }
 
-}  // namespace
-
-namespace sumo {
-
 bool create_blocks_scope(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last)
 {
     if (!ensure_indices(sumo)) return false;
@@ -42,9 +42,8 @@ bool create_blocks_scope(Sumo *sumo, const Scope &scope, uint32_t first, uint32_
             if (obs_all_initialised(o) && !create_obs_blocks(sumo, o, kAll, kAll)) return false;
         return true;
     }
-    if (first == kAll) return true;
     return scope.walk([&](SumoStateVector *s) {
-        if (!is_active(s) || s->index < first || s->index > last) return true;
+        if (!is_active(s) || (first != kAll && (s->index < first || s->index > last))) return true;
         for (SumoObs *o = s->obs_active; o != nullptr; o = o->next_in_state[slot_of(o, s)])
             if (obs_all_initialised(o) && obs_lowest_in_range(o, s, first) &&
                 !create_obs_blocks(sumo, o, first, last))
@@ -72,12 +71,18 @@ PLANO_API SumoOffdiag *pSumoOffdiagNew(Sumo *sumo, SumoStateVector *row, SumoSta
     bool ok = form_mat(&blk->M, r, c, nullptr, __func__) && form_mat(&blk->M_work, r, c, nullptr, __func__) &&
               form_mat(&blk->M_cov, r, c, nullptr, __func__);
     if (ok && T > 0) {
-        const std::size_t each = std::size_t(r) * c;
+        // Each job's accumulator starts on its own cache line: jobs add into the same blocks
+        // at the same time.
+        constexpr std::size_t kLine = 64 / sizeof(double);
+        const std::size_t each = (std::size_t(r) * c + kLine - 1) / kLine * kLine;
         blk->thread_blocks = static_cast<Plx_Matrix *>(alloc_zero(nullptr, sizeof(Plx_Matrix) * T, __func__));
-        auto *data = blk->thread_blocks != nullptr
-                         ? static_cast<double *>(alloc_zero(nullptr, sizeof(double) * each * T, __func__))
+        auto *data = blk->thread_blocks != nullptr && each > 0
+                         ? static_cast<double *>(std::aligned_alloc(64, sizeof(double) * each * T))
                          : nullptr;
-        if (data == nullptr) {
+        if (data != nullptr) std::memset(data, 0, sizeof(double) * each * T);
+        if (data == nullptr && each == 0 && blk->thread_blocks != nullptr) {
+            for (uint32_t t = 0; t < T; ++t) plx_mat_form_data(&blk->thread_blocks[t], r, c, nullptr);
+        } else if (data == nullptr) {
             std::free(blk->thread_blocks);
             blk->thread_blocks = nullptr;
             ok = false;
@@ -218,11 +223,12 @@ PLANO_API Plx_Bool bSumoCreateOffdiagBlocksStateRange(Sumo *sumo, SumoStateVecto
                                                       SumoStateVector *last_state, uint32_t *first,
                                                       uint32_t *last)
 {
-    if (sumo == nullptr || first == nullptr || last == nullptr) {
+    if (first == nullptr || last == nullptr) {
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    if (!range_reachable(first_state, last_state, __func__) || !ensure_indices(sumo)) return PLX_FALSE;
+    Scope scope;
+    if (!open_run(sumo, first_state, last_state, true, __func__, &scope)) return PLX_FALSE;
     uint32_t f, l;
     if (!bSumoGetIndexLimitsStateRange(first_state, last_state, &f, &l)) {
         PLX_ERR_PASS();
@@ -232,9 +238,6 @@ PLANO_API Plx_Bool bSumoCreateOffdiagBlocksStateRange(Sumo *sumo, SumoStateVecto
         PLX_ERR_START(PLX_ERROR_INCOMPATIBLE, "no active state in the range", 0);
         return PLX_FALSE;
     }
-    Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
     if (f != kAll && !create_blocks_scope(sumo, scope, f, l)) {
         PLX_ERR_PASS();
         return PLX_FALSE;

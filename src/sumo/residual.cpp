@@ -12,20 +12,19 @@ namespace {
 struct CostJob {
     Sumo *sumo;
     SumoWorkspace *ws;
-    SumoObs *active;       // first observation of the chunk of the active list
+    SumoObs *const *active;  // the job's chunk of the counted active observations
     uint32_t n_active;
-    SumoObs *eliminated;   // and of the eliminated list
+    SumoObs *const *eliminated;  // and of the eliminated ones
     uint32_t n_eliminated;
     double sum;
 };
 
-double chunk_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, uint32_t count)
+double chunk_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *const *obs, uint32_t count)
 {
     double sum = 0.0;
-    for (uint32_t done = 0; o != nullptr && done < count; o = o->next) {
-        if (!obs_all_initialised(o)) continue;
-        ++done;
-        const double c = obs_cost(sumo, ws, o, "dSumoComputeResidual");
+    for (uint32_t i = 0; i < count; ++i) {
+        prefetch_obs(obs, i, count);
+        const double c = obs_cost(sumo, ws, obs[i], "dSumoComputeResidual");
         if (c == SUMO_FAILED_RESIDUAL) return c;
         sum += c;
     }
@@ -41,21 +40,15 @@ Plx_Bool cost_job(void *argument)
     return job->sum == SUMO_FAILED_RESIDUAL ? PLX_FALSE : PLX_TRUE;
 }
 
-// The starts of T consecutive chunks of the counted observations of a list.
-void chunk_list(SumoObs *head, uint32_t T, std::vector<SumoObs *> &start, std::vector<uint32_t> &count)
+// T consecutive chunks of the counted observations: chunk j holds those numbered [jK/T,
+// (j+1)K/T).
+void chunk_list(const std::vector<SumoObs *> &counted, uint32_t T, std::vector<SumoObs *const *> &start,
+                std::vector<uint32_t> &count)
 {
-    uint64_t K = 0;
-    for (SumoObs *o = head; o != nullptr; o = o->next)
-        if (obs_all_initialised(o)) ++K;
-    uint64_t counted = 0;
-    SumoObs *o = head;
+    const uint64_t K = counted.size();
     for (uint32_t j = 0; j < T; ++j) {
         const uint64_t begin = K * j / T, end = K * (j + 1) / T;
-        while (o != nullptr && (!obs_all_initialised(o) || counted < begin)) {
-            if (obs_all_initialised(o)) ++counted;
-            o = o->next;
-        }
-        start[j] = o;
+        start[j] = counted.data() + begin;
         count[j] = uint32_t(end - begin);
     }
 }
@@ -103,16 +96,23 @@ PLANO_API double dSumoComputeResidual(Sumo *sumo, uint32_t include_eliminated, c
     const uint32_t T = sumo->n_threads == 0 ? 1 : sumo->n_threads;
     SumoWorkspace *ws = job_workspaces(sumo, T);
     if (ws == nullptr) return SUMO_FAILED_RESIDUAL;
-    std::vector<SumoObs *> a_start(T), e_start(T);
+    std::vector<SumoObs *> active, eliminated;
+    if (!collect_counted(sumo, sumo->obs_active, false, active) ||
+        (include_eliminated && !collect_counted(sumo, sumo->obs_eliminated, false, eliminated))) {
+        PLX_ERR_PASS();
+        return SUMO_FAILED_RESIDUAL;
+    }
+    std::vector<SumoObs *const *> a_start(T), e_start(T);
     std::vector<uint32_t> a_count(T), e_count(T, 0);
-    chunk_list(sumo->obs_active, T, a_start, a_count);
-    if (include_eliminated) chunk_list(sumo->obs_eliminated, T, e_start, e_count);
+    chunk_list(active, T, a_start, a_count);
+    chunk_list(eliminated, T, e_start, e_count);
     std::vector<CostJob> jobs(T);
     for (uint32_t j = 0; j < T; ++j)
-        jobs[j] = CostJob{sumo, &ws[j], a_start[j], a_count[j], e_start[j], e_count[j], 0.0};
+        jobs[j] = CostJob{sumo, job_ws(ws, j), a_start[j], a_count[j], e_start[j], e_count[j], 0.0};
     std::vector<ThreadedWorker *> workers(T, nullptr);
-    const plano::JobsResult r =
-        plano::run_jobs(sumo->n_threads == 0 ? nullptr : host, cost_job, jobs.data(), sizeof(CostJob), T, workers.data());
+    const ThreadHostInterface *run_on =
+        sumo->n_threads == 0 ? nullptr : host_for(host, active.size() + eliminated.size(), kMinObsPerJob, T);
+    const plano::JobsResult r = plano::run_jobs(run_on, cost_job, jobs.data(), sizeof(CostJob), T, workers.data());
     if (r != plano::JobsResult::ok) {
         PLX_ERR_PASS_MSG(plano::jobs_failure_message(r), 0);
         return SUMO_FAILED_RESIDUAL;
@@ -136,14 +136,8 @@ PLANO_API double dSumoComputeResidualBranch(Sumo *sumo, SumoBranch *branch, cons
 PLANO_API double dSumoComputeResidualStateRange(Sumo *sumo, SumoStateVector *first_state, SumoStateVector *last_state,
                                                 const ThreadHostInterface *host)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return SUMO_FAILED_RESIDUAL;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return SUMO_FAILED_RESIDUAL;
     Scope scope;
-    scope.first = first_state;
-    scope.last = last_state;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return SUMO_FAILED_RESIDUAL;
     return residual_scope(sumo, scope, host, __func__);
 }
 

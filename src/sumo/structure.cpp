@@ -3,6 +3,7 @@
 // from the heap or a memory stack.
 #include <algorithm>
 #include <cstdlib>
+#include <new>
 #include <vector>
 
 #include "sumo/sumo_internal.hpp"
@@ -82,6 +83,28 @@ bool range_reachable(const SumoStateVector *first, const SumoStateVector *last, 
         if (s == last) return true;
     PLX_ERR_START_AS(function, PLX_ERROR_INCOMPATIBLE, "last state not reachable from first", 0);
     return false;
+}
+
+bool open_run(SumoStateVector *first, SumoStateVector *last, const char *function, Scope *scope)
+{
+    if (!range_reachable(first, last, function)) return false;
+    *scope = Scope::run(first, last);
+    return true;
+}
+
+bool open_run(Sumo *sumo, SumoStateVector *first, SumoStateVector *last, bool renumber, const char *function,
+              Scope *scope)
+{
+    if (sumo == nullptr) {
+        PLX_ERR_START_AS(function, PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
+        return false;
+    }
+    if (!open_run(first, last, function, scope)) return false;
+    if (renumber && !ensure_indices(sumo)) {
+        plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+        return false;
+    }
+    return true;
 }
 
 // ---- observations ----
@@ -457,16 +480,32 @@ bool workspace_grow(SumoWorkspace *ws, uint32_t n)
 
 SumoWorkspace *job_workspaces(Sumo *sumo, uint32_t n)
 {
-    if (n <= sumo->n_job_workspaces) return sumo->job_workspaces;
-    auto *w = static_cast<SumoWorkspace *>(std::realloc(sumo->job_workspaces, sizeof(SumoWorkspace) * n));
+    const uint32_t records = n * kWorkspaceStride;
+    if (records <= sumo->n_job_workspaces) return sumo->job_workspaces;
+    auto *w = static_cast<SumoWorkspace *>(std::realloc(sumo->job_workspaces, sizeof(SumoWorkspace) * records));
     if (w == nullptr) {
-        PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "workspaces", int64_t(sizeof(SumoWorkspace) * n));
+        PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "workspaces", int64_t(sizeof(SumoWorkspace) * records));
         return nullptr;
     }
     sumo->job_workspaces = w;
-    for (uint32_t i = sumo->n_job_workspaces; i < n; ++i) pSumoWorkspaceForm(&w[i]);
-    sumo->n_job_workspaces = n;
+    for (uint32_t i = sumo->n_job_workspaces; i < records; ++i) pSumoWorkspaceForm(&w[i]);
+    sumo->n_job_workspaces = records;
     return w;
+}
+
+bool collect_counted(Sumo *sumo, SumoObs *head, bool make_blocks, std::vector<SumoObs *> &out)
+{
+    try {
+        for (SumoObs *o = head; o != nullptr; o = o->next) {
+            if (!obs_all_initialised(o)) continue;
+            if (make_blocks && !create_obs_blocks(sumo, o, kAll, kAll)) return false;
+            out.push_back(o);
+        }
+    } catch (const std::bad_alloc &) {
+        PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "observation list", int64_t(sizeof(SumoObs *) * out.size()));
+        return false;
+    }
+    return true;
 }
 
 void free_job_workspaces(Sumo *sumo)

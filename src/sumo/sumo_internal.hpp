@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <vector>
 
 #include "common/internal.hpp"
 #include "plano/sumo.h"
@@ -84,6 +85,20 @@ struct Scope {
     SumoBranch *branch = nullptr;
     SumoStateVector *first = nullptr, *last = nullptr;
 
+    static Scope of(SumoBranch *b)
+    {
+        Scope s;
+        s.branch = b;
+        return s;
+    }
+    static Scope run(SumoStateVector *first, SumoStateVector *last)
+    {
+        Scope s;
+        s.first = first;
+        s.last = last;
+        return s;
+    }
+
     template <class F>
     bool walk(F &&f) const
     {
@@ -95,6 +110,35 @@ struct Scope {
         return branch != nullptr ? walk_branch_reverse(branch, f) : walk_range_reverse(first, last, f);
     }
 };
+
+// The set-up every state-range entry point shares: the optimiser present (the overload that
+// takes one), the last state reachable from the first, the indices renumbered when
+// `renumber`; *scope becomes the run. Failures are registered under `function`.
+bool open_run(SumoStateVector *first, SumoStateVector *last, const char *function, Scope *scope);
+bool open_run(Sumo *sumo, SumoStateVector *first, SumoStateVector *last, bool renumber, const char *function,
+              Scope *scope);
+
+// Walks of the eliminated list chase pointers through records scattered over the heap; each
+// step requests what the next steps will read, one link further each: the record four states
+// ahead, the first elimination-block list node three ahead, its block two ahead and that
+// block's M_work one ahead.
+inline void prefetch_eliminated(const SumoStateVector *e)
+{
+    const SumoStateVector *s1 = e->next;
+    if (s1 == nullptr) return;
+    if (const Plx_ListNode *n = s1->elim_blocks.head; n != nullptr && n->data != nullptr) {
+        const auto *k = static_cast<const SumoOffdiag *>(n->data);
+        for (std::size_t b = 0; b < sizeof(double) * k->M_work.rows * k->M_work.cols; b += 64)
+            __builtin_prefetch(reinterpret_cast<const char *>(k->M_work.data) + b);
+    }
+    const SumoStateVector *s2 = s1->next;
+    if (s2 == nullptr) return;
+    if (const Plx_ListNode *n = s2->elim_blocks.head; n != nullptr) __builtin_prefetch(n->data);
+    const SumoStateVector *s3 = s2->next;
+    if (s3 == nullptr) return;
+    __builtin_prefetch(s3->elim_blocks.head);
+    __builtin_prefetch(s3->next);
+}
 
 inline bool is_active(const SumoStateVector *s) { return s->status == SUMO_STATE_ACTIVE; }
 inline uint32_t dim(const SumoStateVector *s) { return s->x.v.rows; }
@@ -117,6 +161,13 @@ void add_atb(double alpha, const double *A, const double *B, uint32_t k, uint32_
 void add_ab(double alpha, const double *A, const double *B, uint32_t n, uint32_t k, uint32_t m, double *C);
 // C (n x m) += alpha A B^T for A (n x k), B (m x k).
 void add_abt(double alpha, const double *A, const double *B, uint32_t n, uint32_t k, uint32_t m, double *C);
+// The same product for the small blocks of the information build, with fixed-size code for
+// the common state dimensions (1, 2, 3, 4, 6, 8, 9): the k-term sums are formed first and
+// added to C once. add_atb_sym adds the symmetric A^T B for A, B (k x n) whose product is
+// symmetric (B = N' A): its lower triangle is added to both triangles, so C stays exactly
+// symmetric.
+void add_atb_block(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, uint32_t m, double *C);
+void add_atb_sym(double alpha, const double *A, const double *B, uint32_t k, uint32_t n, double *C);
 // y (n) += alpha A x for A (n x m); y (m) += alpha A^T x for A (n x m).
 void add_av(double alpha, const double *A, const double *x, uint32_t n, uint32_t m, double *y);
 void add_atv(double alpha, const double *A, const double *x, uint32_t n, uint32_t m, double *y);
@@ -176,11 +227,26 @@ void branch_cut(SumoStateVector *s);
 // ---- workspaces ----
 
 bool workspace_grow(SumoWorkspace *ws, uint32_t n);
-// n workspaces kept in the Sumo for threaded jobs.
+// Workspaces kept in the Sumo for n threaded jobs; job j's is job_ws(base, j). Used records
+// lie a cache line apart: jobs rewrite their workspace's sizes for every observation.
+constexpr uint32_t kWorkspaceStride = sizeof(SumoWorkspace) >= 64 ? 2 : 1 + 64 / sizeof(SumoWorkspace);
 SumoWorkspace *job_workspaces(Sumo *sumo, uint32_t n);
+inline SumoWorkspace *job_ws(SumoWorkspace *base, uint32_t j) { return base + std::size_t(j) * kWorkspaceStride; }
 void free_job_workspaces(Sumo *sumo);
 
 // ---- solver internals shared between files ----
+
+// Threaded passes give every job at least this much work (observations, or states for the
+// parameter store); below it the jobs run one after another on the calling thread, since
+// waking workers would cost more than the work. Each job still writes only its own
+// accumulators, so the results are the same bits either way.
+constexpr uint64_t kMinObsPerJob = 64;
+constexpr uint64_t kMinStatesPerJob = 256;
+inline const ThreadHostInterface *host_for(const ThreadHostInterface *host, uint64_t work, uint64_t min_per_job,
+                                           uint32_t jobs)
+{
+    return work < min_per_job * jobs ? nullptr : host;
+}
 
 // The scope's index limits, with a first of kAll on the root standing for the whole model.
 struct Limits {
@@ -192,8 +258,10 @@ bool evaluate_scope(Sumo *sumo, SumoWorkspace *ws, const Scope &scope, uint32_t 
                     uint32_t last, uint32_t own_first, uint32_t own_last, uint32_t thread);
 bool reset_scope(const Scope &scope, uint32_t last, uint32_t n_threads);
 bool combine_scope(const Scope &scope, uint32_t last, uint32_t into_fixed, uint32_t n_threads);
+// With cost given (root, whole model, residual flag set), *cost receives the total cost at
+// the parameters of the build, from the same evaluations.
 bool build_scope(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t first, uint32_t last,
-                 const ThreadHostInterface *host, const char *function);
+                 const ThreadHostInterface *host, const char *function, double *cost = nullptr);
 bool increment_scope(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last);
 bool adjust_info_vector_scope(const Scope &scope, uint32_t first, uint32_t last);
 bool store_scope(const Scope &scope, const ThreadHostInterface *host);
@@ -214,12 +282,39 @@ void push_increment(const SumoStateVector *s, const double *delta);
 bool cascade_eliminated(Sumo *sumo);
 void init_elim_state_covariance(Sumo *sumo, SumoStateVector *target, bool covariance_mode);
 bool compute_elim_state_covariance(Sumo *sumo, SumoStateVector *target);
+// Makes the blocks of the observations the scope owns within [first, last] (first kAll: all
+// of them; on the root, every active observation).
 bool create_blocks_scope(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last);
+// Makes the blocks between every pair of the observation's states with index in [first, last].
+bool create_obs_blocks(Sumo *sumo, const SumoObs *obs, uint32_t first, uint32_t last);
+// Appends the observations of a Sumo list whose states are all initialised, in list order
+// (making their blocks when asked).
+bool collect_counted(Sumo *sumo, SumoObs *head, bool make_blocks, std::vector<SumoObs *> &out);
+// Called before evaluating obs[i] of n: the records lie scattered over the heap, so the
+// record of obs[i + 4] and then the arrays of obs[i + 2] (its record fetched by now) are
+// requested ahead.
+inline void prefetch_obs(SumoObs *const *obs, uint32_t i, uint32_t n)
+{
+    if (i + 4 < n) {
+        const char *r = reinterpret_cast<const char *>(obs[i + 4]);
+        for (std::size_t line = 0; line < sizeof(SumoObs); line += 64) __builtin_prefetch(r + line);
+    }
+    if (i + 2 < n) {
+        const SumoObs *o = obs[i + 2];
+        __builtin_prefetch(o->states);
+        __builtin_prefetch(o->z.v.data);
+        __builtin_prefetch(o->N.data);
+    }
+}
 double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *obs, const char *function);
 // Evaluates an observation into the workspace (prediction, wanted Jacobians, residual,
 // effective information and chi-squared); see evaluate.cpp.
 bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool decide, bool jacobians,
                   uint32_t first, uint32_t last, double *chi2);
+// bSumoObsEvaluate without the argument checks; *cost receives the observation's cost at
+// the current parameters (0 without the residual flag).
+bool accumulate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *obs, uint32_t residual, uint32_t eliminate, uint32_t add,
+                    uint32_t first, uint32_t last, uint32_t thread, double *cost);
 
 }  // namespace sumo
 

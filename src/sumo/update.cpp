@@ -37,21 +37,6 @@ Plx_Bool store_job(void *argument)
     return PLX_TRUE;
 }
 
-Scope branch_scope(SumoBranch *b)
-{
-    Scope s;
-    s.branch = b;
-    return s;
-}
-
-Scope range_scope(SumoStateVector *first, SumoStateVector *last)
-{
-    Scope s;
-    s.first = first;
-    s.last = last;
-    return s;
-}
-
 }  // namespace
 
 namespace sumo {
@@ -68,6 +53,13 @@ bool increment_scope(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t la
 bool store_scope(const Scope &scope, const ThreadHostInterface *host)
 {
     const uint32_t T = host != nullptr ? plano::job_count(host) : 1;
+    uint64_t states = 0;
+    if (T > 1)
+        scope.walk([&](SumoStateVector *s) {
+            states += is_active(s) ? 1 : 0;
+            return true;
+        });
+    host = host_for(host, states, kMinStatesPerJob, T);
     std::vector<StoreJob> jobs(T);
     for (uint32_t j = 0; j < T; ++j) jobs[j] = StoreJob{&scope, j, T};
     std::vector<ThreadedWorker *> workers(T, nullptr);
@@ -109,8 +101,10 @@ bool adjust_info_vector_scope(const Scope &scope, uint32_t first, uint32_t last)
 // eliminated state to the oldest (each one's increment held in its b_work).
 void zero_eliminated_increments(Sumo *sumo)
 {
-    for (SumoStateVector *e = sumo->elim_last; e != nullptr; e = e->next)
+    for (SumoStateVector *e = sumo->elim_last; e != nullptr; e = e->next) {
+        if (e->next != nullptr) __builtin_prefetch(e->next->next);
         if (dim(e) > 0) std::memset(e->b_work.data, 0, sizeof(double) * dim(e));
+    }
 }
 
 // Pushes a state's increment to the eliminated states linked to it (their b_work).
@@ -124,12 +118,17 @@ void push_increment(const SumoStateVector *s, const double *delta)
 
 bool cascade_eliminated(Sumo *sumo)
 {
+    // Covariances are cleared on the way: the adjust functions see only parameters.
     for (SumoStateVector *e = sumo->elim_last; e != nullptr; e = e->next) {
+        prefetch_eliminated(e);
         add_into(e->x.v.data, e->b_work.data, dim(e));
-        if (!call_adjust(sumo, e, 0, "bAdjustEliminatedStates")) return false;
+        e->covariance_valid = 0;
+        if (!call_adjust(sumo, e, 0, "bAdjustEliminatedStates")) {
+            for (SumoStateVector *rest = e->next; rest != nullptr; rest = rest->next) rest->covariance_valid = 0;
+            return false;
+        }
         push_increment(e, e->b_work.data);
     }
-    for (SumoStateVector *e = sumo->elim_last; e != nullptr; e = e->next) e->covariance_valid = 0;
     return true;
 }
 
@@ -157,17 +156,14 @@ PLANO_API Plx_Bool bIncrementParametersBranch(Sumo *sumo, SumoBranch *branch)
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    return increment_scope(sumo, branch_scope(branch), kAll, kAll) ? PLX_TRUE : PLX_FALSE;
+    return increment_scope(sumo, Scope::of(branch), kAll, kAll) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bIncrementParametersStateRange(Sumo *sumo, SumoStateVector *first_state, SumoStateVector *last_state)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
-    return increment_scope(sumo, range_scope(first_state, last_state), kAll, kAll) ? PLX_TRUE : PLX_FALSE;
+    Scope scope;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
+    return increment_scope(sumo, scope, kAll, kAll) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoStoreParametersBranch(SumoBranch *branch, const ThreadHostInterface *host)
@@ -176,14 +172,15 @@ PLANO_API Plx_Bool bSumoStoreParametersBranch(SumoBranch *branch, const ThreadHo
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    return store_scope(branch_scope(branch), host) ? PLX_TRUE : PLX_FALSE;
+    return store_scope(Scope::of(branch), host) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoStoreParametersStateRange(SumoStateVector *first_state, SumoStateVector *last_state,
                                                   const ThreadHostInterface *host)
 {
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
-    return store_scope(range_scope(first_state, last_state), host) ? PLX_TRUE : PLX_FALSE;
+    Scope scope;
+    if (!open_run(first_state, last_state, __func__, &scope)) return PLX_FALSE;
+    return store_scope(scope, host) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoReinstateOldParametersBranch(Sumo *sumo, SumoBranch *branch)
@@ -192,18 +189,15 @@ PLANO_API Plx_Bool bSumoReinstateOldParametersBranch(Sumo *sumo, SumoBranch *bra
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    return reinstate_scope(sumo, branch_scope(branch)) ? PLX_TRUE : PLX_FALSE;
+    return reinstate_scope(sumo, Scope::of(branch)) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoReinstateOldParametersStateRange(Sumo *sumo, SumoStateVector *first_state,
                                                          SumoStateVector *last_state)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
-    return reinstate_scope(sumo, range_scope(first_state, last_state)) ? PLX_TRUE : PLX_FALSE;
+    Scope scope;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
+    return reinstate_scope(sumo, scope) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bSumoReinstateOldParametersState(Sumo *sumo, SumoStateVector *state)
@@ -223,18 +217,15 @@ PLANO_API Plx_Bool bAdjustInformationVectorBranch(Sumo *sumo, SumoBranch *branch
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    return adjust_info_vector_scope(branch_scope(branch), first, last) ? PLX_TRUE : PLX_FALSE;
+    return adjust_info_vector_scope(Scope::of(branch), first, last) ? PLX_TRUE : PLX_FALSE;
 }
 
 PLANO_API Plx_Bool bAdjustInformationVectorStateRange(Sumo *sumo, SumoStateVector *first_state,
                                                       SumoStateVector *last_state, uint32_t first, uint32_t last)
 {
-    if (sumo == nullptr) {
-        PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
-        return PLX_FALSE;
-    }
-    if (!range_reachable(first_state, last_state, __func__)) return PLX_FALSE;
-    return adjust_info_vector_scope(range_scope(first_state, last_state), first, last) ? PLX_TRUE : PLX_FALSE;
+    Scope scope;
+    if (!open_run(sumo, first_state, last_state, false, __func__, &scope)) return PLX_FALSE;
+    return adjust_info_vector_scope(scope, first, last) ? PLX_TRUE : PLX_FALSE;
 }
 
 }  // extern "C"

@@ -1,4 +1,5 @@
 // The solver against closed forms and against a dense Gauss-Newton reference.
+#include <functional>
 #include <random>
 
 #include "sumo_test_util.hpp"
@@ -29,18 +30,24 @@ struct LineFit {
     std::vector<double> xs, ys;
     double sigma = 0.5;
 
-    explicit LineFit(bool numeric, const ThreadHostInterface *host = nullptr) : sumo(pSumoForm(nullptr, host))
+    // `points` observations (enough for real worker threads to take part when many).
+    explicit LineFit(bool numeric, const ThreadHostInterface *host = nullptr, int points = 12)
+        : sumo(pSumoForm(nullptr, host))
     {
         line = pSumoStateVectorNew(sumo.get(), sumo->root, 2, nullptr, nullptr);
         Vec x0{0.3, -1.0};
         EXPECT_TRUE(bSumoStateVectorInit(sumo.get(), line, &x0.v));
         std::mt19937 rng(7);
         std::normal_distribution<double> noise(0.0, sigma);
-        for (int i = 0; i < 12; ++i) {
-            xs.push_back(i * 0.7 - 3.0);
+        for (int i = 0; i < points; ++i) {
+            xs.push_back(i * 8.4 / points - 3.0);
             ys.push_back(1.7 * xs.back() + 0.4 + noise(rng));
         }
-        for (int i = 0; i < 12; ++i) {
+        add(0, points, numeric);
+    }
+    void add(int from, int to, bool numeric)
+    {
+        for (int i = from; i < to; ++i) {
             Vec z{ys[i]};
             Squ Ni(1, 1.0 / (sigma * sigma));
             SumoObs *o = pSumoObsH_va(sumo.get(), &z.v, &Ni.m, h_line, nullptr, line, nullptr);
@@ -204,10 +211,13 @@ TEST(SumoSolver, FailingObservationFailsTheIterationOnAnyThread)
     for (uint32_t jobs : {0u, 3u}) {
         HostPtr host(jobs ? plano_host_new(jobs) : nullptr);
         const ThreadHostInterface *iface = jobs ? plano_host_interface(host.get()) : nullptr;
-        LineFit fit(false, iface);
+        // Enough observations for the jobs to run on workers, the failing one in the middle
+        // chunk (not the caller's).
+        LineFit fit(false, iface, 1000);
         Vec z{0.0};
         Squ Ni(1, 1.0);
         ASSERT_NE(pSumoObsH_va(fit.sumo.get(), &z.v, &Ni.m, h_fails, nullptr, fit.line, nullptr), nullptr);
+        fit.add(0, 1000, false);
         EXPECT_EQ(dSumoComputeResidual(fit.sumo.get(), 0, iface), SUMO_FAILED_RESIDUAL);
         EXPECT_FALSE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
                                                     nullptr, nullptr, iface));
@@ -368,6 +378,28 @@ TEST(SumoSolver, StateRangeSolvesItsRunWithTheRestHeld)
     EXPECT_EQ(first->A_work.data[0], first->A.data[0]);
 }
 
+// Everything a build leaves in the work copies, state by state in index order.
+std::vector<double> work_copies(Sumo *sumo)
+{
+    std::vector<SumoStateVector *> states;
+    collect(sumo->root, states);
+    std::vector<double> v;
+    for (SumoStateVector *s : states) {
+        const uint32_t n = s->x.v.rows;
+        v.insert(v.end(), s->A_work.data, s->A_work.data + n * n);
+        v.insert(v.end(), s->b_work.data, s->b_work.data + n);
+        for (SumoOffdiag *k = s->row_blocks; k != nullptr; k = k->row_next)
+            v.insert(v.end(), k->M_work.data, k->M_work.data + k->M_work.rows * k->M_work.cols);
+    }
+    return v;
+}
+
+void expect_close(const std::vector<double> &x, const std::vector<double> &ref, double tol, const char *what)
+{
+    ASSERT_EQ(x.size(), ref.size()) << what;
+    for (size_t i = 0; i < x.size(); ++i) EXPECT_NEAR(x[i], ref[i], tol * (1.0 + std::abs(ref[i]))) << what << " " << i;
+}
+
 TEST(SumoSolver, SameParametersForAnyNumberOfJobs)
 {
     auto solve = [](const ThreadHostInterface *host, bool range) {
@@ -396,6 +428,24 @@ TEST(SumoSolver, SameParametersForAnyNumberOfJobs)
             for (int i = 0; i < 2; ++i) x.push_back(s->x.v.data[i]);
         return x;
     };
+    // Enough observations for real workers: a line through 3,000 points, some of them with
+    // central differences, solved in one Gauss-Newton step.
+    {
+        auto fit_line = [](const ThreadHostInterface *host) {
+            LineFit fit(false, host, 3000);
+            for (SumoObs *o = fit.sumo->obs_active; o != nullptr && o->next != nullptr; o = o->next->next)
+                o->numeric_jacobians = 1;
+            EXPECT_TRUE(bSumoLevMarqIterationBranchGen(fit.sumo.get(), fit.sumo->root, nullptr, 1, 0.0, 0, kAll, kAll,
+                                                       nullptr, nullptr, host));
+            return std::vector<double>{fit.line->x.v.data[0], fit.line->x.v.data[1],
+                                       dSumoComputeResidual(fit.sumo.get(), 0, host)};
+        };
+        const std::vector<double> reference = fit_line(nullptr);
+        for (uint32_t jobs : {1u, 2u, 5u}) {
+            HostPtr host(plano_host_new(jobs));
+            expect_close(fit_line(plano_host_interface(host.get())), reference, 1e-12, "line");
+        }
+    }
     // Accumulation order differs between job counts, and the central differences keep the
     // iteration from converging quadratically, so agreement is to rounding amplified a little;
     // a job seeing another's difference step would be off by about the step (1e-7).
@@ -410,6 +460,243 @@ TEST(SumoSolver, SameParametersForAnyNumberOfJobs)
         }
     }
     vThreadedWorkerPoolFree();
+}
+
+TEST(SumoSolver, StateRangeEvaluationSameForAnyNumberOfJobs)
+{
+    // Jobs take contiguous index sub-ranges and their own accumulators; the result must be
+    // what one thread makes, including what lands on states outside the run (an unset first
+    // index asks for every Jacobian, so r2 receives r1's coupling).
+    auto evaluate = [](const ThreadHostInterface *host) {
+        Chain c(host);
+        EXPECT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+        EXPECT_TRUE(bSumoResetInfoBranch(c.sumo.get(), c.sumo->root, kAll));
+        uint32_t lo, hi;
+        EXPECT_TRUE(bSumoGetIndexLimitsStateRange(c.root_states[1], c.root_states[3], &lo, &hi));
+        EXPECT_TRUE(bSumoEvaluateObsStateRange(c.sumo.get(), c.root_states[1], c.root_states[3], lo, hi, host));
+        std::vector<double> v = work_copies(c.sumo.get());
+        EXPECT_TRUE(bSumoResetInfoBranch(c.sumo.get(), c.sumo->root, kAll));
+        EXPECT_TRUE(bSumoEvaluateObsStateRange(c.sumo.get(), c.root_states[0], c.root_states[1], kAll, kAll, host));
+        const std::vector<double> w = work_copies(c.sumo.get());
+        v.insert(v.end(), w.begin(), w.end());
+        EXPECT_TRUE(bSumoResetInfoBranch(c.sumo.get(), c.sumo->root, kAll));
+        EXPECT_TRUE(bSumoEvaluateObsBranch(c.sumo.get(), c.sumo->root, kAll, kAll, host));
+        const std::vector<double> u = work_copies(c.sumo.get());
+        v.insert(v.end(), u.begin(), u.end());
+        return v;
+    };
+    const std::vector<double> reference = evaluate(nullptr);
+    // The whole model evaluated once more equals the dense normal equations.
+    {
+        Chain c;
+        ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+        const DenseSystem d = dense_system(c.sumo.get());
+        ASSERT_TRUE(bSumoResetInfoBranch(c.sumo.get(), c.sumo->root, kAll));
+        ASSERT_TRUE(bSumoEvaluateObsBranch(c.sumo.get(), c.sumo->root, kAll, kAll, nullptr));
+        for (SumoStateVector *s : c.all()) {
+            const int o = d.offset.at(s);
+            EXPECT_LT((dense(s->A_work) - d.H.block(o, o, 2, 2)).norm(), 1e-12);
+            EXPECT_LT(std::hypot(s->b_work.data[0] - d.g[o], s->b_work.data[1] - d.g[o + 1]), 1e-12);
+        }
+    }
+    for (uint32_t jobs : {1u, 2u, 5u}) {
+        HostPtr host(plano_host_new(jobs));
+        expect_close(evaluate(plano_host_interface(host.get())), reference, 1e-13, "jobs");
+    }
+    vThreadedWorkerPoolFree();
+}
+
+TEST(SumoSolver, CostCachedByTheIterationIsTheTotalCost)
+{
+    // The first iteration after a change takes the cost at the stored parameters from its
+    // own linearisation; it must be the total cost, to the bit, whatever the job count.
+    for (uint32_t jobs : {0u, 1u, 2u, 5u}) {
+        HostPtr host(jobs ? plano_host_new(jobs) : nullptr);
+        const ThreadHostInterface *iface = jobs ? plano_host_interface(host.get()) : nullptr;
+        Chain c(iface);
+        for (double lambda : {1e-2, 1e6}) {
+            c.sumo->modified = 1;
+            const double before = dSumoComputeResidual(c.sumo.get(), 0, iface);
+            uint32_t accepted = 9;
+            double reduction = -1.0;
+            ASSERT_TRUE(bSumoLevMarqIterationBranchGen(c.sumo.get(), c.sumo->root, nullptr, 1, lambda, 0, kAll, kAll,
+                                                       &accepted, &reduction, iface));
+            const double after = dSumoComputeResidual(c.sumo.get(), 0, iface);
+            EXPECT_EQ(c.sumo->modified, 0u);
+            EXPECT_EQ(c.sumo->residual, after) << jobs << " jobs";
+            if (accepted)
+                EXPECT_EQ(reduction, before - after) << jobs << " jobs";
+            else
+                EXPECT_EQ(after, before) << jobs << " jobs";
+        }
+    }
+    vThreadedWorkerPoolFree();
+}
+
+// h = sum_i J_i x_i with fixed matrices, for states of any dimension.
+struct LinearObs {
+    std::vector<Eigen::MatrixXd> J;
+};
+
+Plx_Bool h_linear(Sumo *, SumoWorkspace *, SumoStateVector **s, uint32_t n, const SumoVector *z, Plx_Vector *h,
+                  Plx_Matrix **J)
+{
+    const auto *L = static_cast<const LinearObs *>(z->user_data);
+    Eigen::VectorXd v = Eigen::VectorXd::Zero(z->v.rows);
+    for (uint32_t i = 0; i < n; ++i) {
+        v += L->J[i] * params(s[i]);
+        if (J != nullptr && J[i] != nullptr)
+            for (int r = 0; r < L->J[i].rows(); ++r)
+                for (int c = 0; c < L->J[i].cols(); ++c) J[i]->data[r * L->J[i].cols() + c] = L->J[i](r, c);
+    }
+    for (uint32_t r = 0; r < z->v.rows; ++r) h->data[r] = v[r];
+    return PLX_TRUE;
+}
+
+TEST(SumoSolver, InformationOfEveryBlockSizeMatchesTheDenseSums)
+{
+    // Dimensions with fixed-size kernels (2, 6, 9), without (5, 7) and beyond the stack
+    // buffer (17); diagonal, scaled-identity and full information matrices.
+    SumoPtr sumo(pSumoForm(nullptr, nullptr));
+    std::mt19937 rng(3);
+    std::uniform_real_distribution<double> u(-1.0, 1.0);
+    std::vector<SumoStateVector *> st;
+    for (uint32_t n : {2u, 5u, 9u, 17u, 6u, 7u}) {
+        st.push_back(pSumoStateVectorNew(sumo.get(), sumo->root, n, nullptr, nullptr));
+        Eigen::VectorXd x(n);
+        for (uint32_t i = 0; i < n; ++i) x[i] = u(rng);
+        Vec xv(x);
+        ASSERT_TRUE(bSumoStateVectorInit(sumo.get(), st.back(), &xv.v));
+    }
+    const std::vector<std::vector<int>> links = {{0, 1}, {1, 2}, {2, 3}, {3, 4}, {4, 5}, {0, 5}, {1, 3, 5}, {2}};
+    std::vector<std::unique_ptr<LinearObs>> data;
+    int kind = 0;
+    for (const auto &link : links) {
+        const int m = 3 + kind % 2;
+        auto L = std::make_unique<LinearObs>();
+        std::vector<SumoStateVector *> obs_states;
+        for (int i : link) {
+            L->J.push_back(Eigen::MatrixXd::NullaryExpr(m, st[i]->x.v.rows, [&] { return u(rng); }));
+            obs_states.push_back(st[i]);
+        }
+        Eigen::VectorXd z(m);
+        for (int i = 0; i < m; ++i) z[i] = u(rng);
+        Vec zv(z);
+        std::unique_ptr<Squ> N;
+        if (kind % 3 == 0) {
+            N = std::make_unique<Squ>(m, 2.5);
+        } else if (kind % 3 == 1) {
+            N = std::make_unique<Squ>(Eigen::MatrixXd(Eigen::VectorXd::LinSpaced(m, 0.5, 3.0).asDiagonal()));
+            N->m.type = PLX_SQUMAT_DIAGONAL;
+            for (int i = 0; i < m; ++i) N->m.data[i] = 0.5 + 2.5 * i / (m - 1);
+        } else {
+            const Eigen::MatrixXd R = Eigen::MatrixXd::NullaryExpr(m, m, [&] { return u(rng); });
+            N = std::make_unique<Squ>(Eigen::MatrixXd(R * R.transpose() + Eigen::MatrixXd::Identity(m, m)));
+        }
+        SumoObs *o = pSumoObsH(sumo.get(), &zv.v, &N->m, h_linear, nullptr, obs_states.data(),
+                               uint32_t(obs_states.size()));
+        ASSERT_NE(o, nullptr);
+        o->z.user_data = L.get();
+        data.push_back(std::move(L));
+        ++kind;
+    }
+    ASSERT_TRUE(bSumoBuildInformationBlocksBranch(sumo.get(), sumo->root, 1, kAll, kAll, nullptr));
+    const DenseSystem d = dense_system(sumo.get());
+    for (SumoStateVector *s : st) {
+        const int o = d.offset.at(s), n = int(s->x.v.rows);
+        const Eigen::MatrixXd A = dense(s->A_work);
+        EXPECT_LT((A - d.H.block(o, o, n, n)).norm(), 1e-12 * d.H.norm()) << "dimension " << n;
+        EXPECT_EQ((A - A.transpose()).norm(), 0.0) << "dimension " << n;
+        for (int i = 0; i < n; ++i) EXPECT_NEAR(s->b_work.data[i], d.g[o + i], 1e-12 * d.g.norm());
+        for (SumoOffdiag *k = s->row_blocks; k != nullptr; k = k->row_next) {
+            Eigen::MatrixXd M(k->M_work.rows, k->M_work.cols);
+            for (uint32_t i = 0; i < k->M_work.rows; ++i)
+                for (uint32_t j = 0; j < k->M_work.cols; ++j) M(i, j) = k->M_work.data[i * k->M_work.cols + j];
+            EXPECT_LT((M - d.H.block(o, d.offset.at(k->col), M.rows(), M.cols())).norm(), 1e-12 * d.H.norm());
+        }
+    }
+}
+
+TEST(SumoSolver, StateRangeEntryPointsCheckTheirRun)
+{
+    // Every entry point on a run of states refuses a missing optimiser or state and a last
+    // state that cannot be reached from the first, under its own name, and changes nothing.
+    Chain c;
+    ASSERT_TRUE(bSumoSetStateIndices(c.sumo.get()));
+    SumoStateVector *a = c.root_states[1], *b = c.root_states[3];
+    const Eigen::VectorXd kept = params(a);
+    uint32_t f, l;
+    int32_t code;
+    using Call = std::function<bool(Sumo *, SumoStateVector *, SumoStateVector *)>;
+    const std::vector<std::pair<const char *, Call>> calls = {
+        {"bSumoBuildInformationBlocksStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoBuildInformationBlocksStateRange(s, p, q, 2, 6, nullptr) != 0;
+         }},
+        {"bSumoEvaluateObsStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoEvaluateObsStateRange(s, p, q, 2, 6, nullptr) != 0;
+         }},
+        {"bSumoResetInfoStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoResetInfoStateRange(s, p, q, kAll) != 0;
+         }},
+        {"bSumoCombineThreadedInfoStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoCombineThreadedInfoStateRange(s, p, q, kAll, 0) != 0;
+         }},
+        {"bRecursiveEliminationStateRange",
+         [&](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bRecursiveEliminationStateRange(s, p, q, 1, 0.0, 0, kAll, &code) != 0;
+         }},
+        {"bBackSubstitutionStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bBackSubstitutionStateRange(s, p, q, nullptr, 1, 2, 6) != 0;
+         }},
+        {"bIncrementParametersStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bIncrementParametersStateRange(s, p, q) != 0;
+         }},
+        {"bSumoReinstateOldParametersStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoReinstateOldParametersStateRange(s, p, q) != 0;
+         }},
+        {"bAdjustInformationVectorStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bAdjustInformationVectorStateRange(s, p, q, 2, 6) != 0;
+         }},
+        {"dSumoComputeResidualStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return dSumoComputeResidualStateRange(s, p, q, nullptr) != SUMO_FAILED_RESIDUAL;
+         }},
+        {"bSumoLevMarqIterationStateRange",
+         [](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoLevMarqIterationStateRange(s, p, q, 1.0, 0, 2, 6, nullptr, nullptr, nullptr) != 0;
+         }},
+        {"bSumoCreateOffdiagBlocksStateRange",
+         [&](Sumo *s, SumoStateVector *p, SumoStateVector *q) {
+             return bSumoCreateOffdiagBlocksStateRange(s, p, q, &f, &l) != 0;
+         }},
+    };
+    Plx_ErrorRecord r;
+    for (const auto &[name, call] : calls) {
+        EXPECT_FALSE(call(nullptr, a, b)) << name;
+        EXPECT_EQ(error_code(), PLX_ERROR_ILLEGAL_ARGUMENT) << name;
+        ASSERT_TRUE(plx_err_get_error(0, &r));
+        EXPECT_STREQ(r.function, name);
+        EXPECT_FALSE(call(c.sumo.get(), a, nullptr)) << name;
+        EXPECT_EQ(error_code(), PLX_ERROR_ILLEGAL_ARGUMENT) << name;
+        EXPECT_FALSE(call(c.sumo.get(), b, a)) << name;
+        EXPECT_EQ(error_code(), PLX_ERROR_INCOMPATIBLE) << name;
+        ASSERT_TRUE(plx_err_get_error(0, &r));
+        EXPECT_STREQ(r.function, name);
+        EXPECT_EQ(params(a), kept) << name;
+    }
+    // The two without an optimiser argument check the run alike.
+    EXPECT_FALSE(bDampInformationMatrixStateRange(b, a, 1.0, 0));
+    EXPECT_EQ(error_code(), PLX_ERROR_INCOMPATIBLE);
+    EXPECT_FALSE(bSumoStoreParametersStateRange(nullptr, b, nullptr));
+    EXPECT_EQ(error_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
 }
 
 // ---- a homography from noisy point pairs ----
