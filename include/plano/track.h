@@ -138,9 +138,15 @@ struct TrackRegion {
     /* Buffers handed to pTrackRegion (borrowed, may be null). */
     Plx_Image *correlation_buffer;
     Plx_Image *template_buffer;
-    /* Images and pyramid records the region made and frees (null when borrowed). */
-    Plx_Image *owned_images[8];
+    /* Images and pyramid records the region made, released by vTrackFree (null slots are
+     * unused; caller buffers and pyramid storage never appear here). */
+    Plx_Image *owned_images[10];
     Plx_ImagePyramid *owned_pyramids[3];
+    /* Channel the windows were cut from: 0 every channel, else 1 red, 2 green, 3 blue. */
+    uint32_t active_channel;
+    /* 1 while homography and information are in window pixels (from pTrackRegion until
+     * bTrackOptimise hands them back in calibrated coordinates). */
+    uint32_t in_window_pixels;
 };
 
 struct TrackConstraintPoint {
@@ -180,7 +186,12 @@ PLANO_API void vTrackRegionSetBoundaryDistanceWeighting(TrackRegion *region, uin
 /* Adds a region at the head of the track's list. Images are borrowed; the camera, homography
  * (reference -> previous frame, calibrated), information (may be null) and intensity model
  * (gain, offset; null gives 1, 0) are copied. Buffers and pyramid records may be null; given
- * ones are reused and never freed. Returns null with the track unchanged on failure. */
+ * ones are reused and never freed. Code 32 for a negative smoothing sigma, a rotation range
+ * outside [0, pi], a negative scale range, a rotation sweep without a positive step or an
+ * intensity sigma that is not positive; 12 an unknown model; 7 information of another size;
+ * 24 an empty region mask; 23 a search window wholly outside the current image. When the
+ * previous and current images are one image, the region's own window is also its search
+ * window. Returns null with the track unchanged on failure. */
 PLANO_API TrackRegion *pTrackRegion(
     Track *track, Plx_Image *previous_mask, Plx_Image *reference_image,
     const Plx_Camera *reference_camera, Plx_Image *reference_mask, Plx_Image *current_valid_mask,
@@ -198,8 +209,8 @@ PLANO_API TrackRegion *pTrackRegion(
     Plx_ImagePyramid *reference_pyramid_storage, const ThreadHostInterface *host);
 
 /* Constraint points: reference_information and target_information are (xx, xy, yy). A null
- * target point means the optimiser estimates it. Code 7 when a region already has 4 points
- * (the point stays in the track's list). */
+ * target point means the optimiser estimates it. Code 7 when a region already has 4 points,
+ * is listed twice or is not one of the track's regions; nothing is added then. */
 PLANO_API TrackConstraintPoint *pTrackConstraintPoint1Region(
     Track *track, TrackRegion *region, const double reference_point[2],
     const double reference_information[3], const double target_point[2],
@@ -220,7 +231,7 @@ PLANO_API Plx_Bool bAngleConstraint(Track *track, TrackConstraintPoint *a, Track
 /* ---- models, estimates, progress ---- */
 
 /* The more general of two models (projective > affine > trans-rot-scale > trans-scale >
- * translation). */
+ * translation); 0xFFFFFFFF with code 12 when either is not a model. */
 PLANO_API uint32_t eMostGeneralTrackingModel(uint32_t model_a, uint32_t model_b);
 /* Work estimates in arbitrary units, shared by the progress reports. */
 PLANO_API double dTrackEstimateCorrTime(const Track *track);
@@ -228,22 +239,27 @@ PLANO_API double dTrackEstimateHomogTime(uint32_t level);
 /* Adds increment to the done part; calls progress(context, percentage 0..99) when given. */
 PLANO_API void vStatusTimeIncrement(StatusTime *status_time, double increment,
                                     ThreadProgressFunction progress, void *context);
-/* New 9x9 information matrix of a projective homography with no information along H itself. */
+/* New 9x9 information matrix (positive semi-definite) of a projective homography with no
+ * information along H itself. Code 18 for a zero H. */
 PLANO_API Plx_SquMatrix *pgsymmatComputeInformationMatrix(const Plx_Matrix33 *homography);
 
 /* ---- homography conversions ---- */
 
-/* Brings H to its model's shape (dividing by H22, code 18 when 0); *scale receives H22 (1 for
- * projective). */
+/* Brings H to its model's shape (dividing by H22, code 18 when 0); *scale (may be null)
+ * receives H22. A projective H is left as it is, any H22 included, with scale 1. */
 PLANO_API Plx_Bool bCorrectHomography(uint32_t model, Plx_Matrix33 *homography, double *scale);
 /* direction 0: pixels -> calibrated, H = K_A^-1 H K_B; direction 1: calibrated -> pixels,
- * H = K_A H K_B^-1 (K_B the region camera's matrix). The information matrix, when given, is
- * carried through the parameter change. */
+ * H = K_A H K_B^-1 (K_B the region camera's matrix; each K divided by its zh), after which
+ * the reduced models take the nearest member of their family. The information matrix, when
+ * given (of the model's size, code 7), becomes J^T I J with J = d(old parameters) / d(new
+ * parameters); parameters: affine (H00 H01 H02 H10 H11 H12), projective the nine entries,
+ * translation (H02 H12), trans-rot-scale (a tx b ty), trans-scale (s tx ty). */
 PLANO_API Plx_Bool bTrackApplyCalibToHomography(Plx_Matrix33 *homography,
                                                 Plx_SquMatrix *information, uint32_t model,
                                                 const Plx_Camera *camera_a,
                                                 const TrackRegion *region, uint32_t direction);
-/* H = T(offset_a / zh_a) H T(-offset_b / zh_b), signs reversed when inverse is 1. */
+/* H = T(offset_a / zh_a) H T(-offset_b / zh_b), signs reversed when inverse is nonzero; the
+ * information as above. Code 18 when a zh is 0. */
 PLANO_API Plx_Bool bTrackApplyOffsetsToHomography(Plx_Matrix33 *homography,
                                                   Plx_SquMatrix *information, uint32_t model,
                                                   const double offset_a[2], double zh_a,
@@ -254,6 +270,21 @@ PLANO_API Plx_Bool bTrackApplyOffsetsToHomography(Plx_Matrix33 *homography,
 PLANO_API Plx_Bool bComputeActiveChannel(const Plx_Image *image, const Plx_Image *mask,
                                          int32_t row0, int32_t col0, uint32_t height,
                                          uint32_t width, uint32_t *channel);
+
+/* Cuts a region out of image: the bounding box of mask's set pixels (mask null: the whole
+ * image; a mask without set pixels fails with code 24), grown through a non-linear camera to
+ * cover the undistorted region and made odd-sized where the image allows. window receives the
+ * box's pixels (resampled into the camera's linear version when the camera has distortion;
+ * frame offset = the box's frame position) and window_mask the box's mask bits (all set
+ * without a mask). With extract_active_channel set and a colour image, only one channel is
+ * cut, as a grey image: *channel on entry (1 red, 2 green, 3 blue; 0 = choose it with
+ * bComputeActiveChannel); *channel receives the channel used (0 = all). box receives the box
+ * in the image's pixel coordinates. window and window_mask are zeroed records or images to
+ * re-form; camera null means a linear camera. */
+PLANO_API Plx_Bool bExtractRegion(const Plx_Image *image, const Plx_Image *mask,
+                                  const Plx_Camera *camera, uint32_t extract_active_channel,
+                                  uint32_t *channel, Plx_Image *window, Plx_Image *window_mask,
+                                  Plx_Window *box);
 
 /* ---- reading and freeing ---- */
 
@@ -270,7 +301,9 @@ PLANO_API void vTrackFree(Track *track);
 
 /* Tracks every region from the previous frame to the current one: coarse search, then the
  * joint homography optimisation, then back to calibrated coordinates. host may be null; an
- * interrupt through it returns 1 with the regions as far as they got. */
+ * interrupt through it returns 1 with the regions as far as they got. Whatever the outcome,
+ * the regions' homographies and information matrices are left in calibrated coordinates;
+ * a projective homography comes back with unit Frobenius norm. */
 PLANO_API Plx_Bool bTrackOptimise(Track *track, int32_t iterations, double lambda,
                                   double lambda_factor, const ThreadHostInterface *host);
 

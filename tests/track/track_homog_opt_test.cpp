@@ -1,0 +1,925 @@
+// The joint homography optimiser: the pixel-match, homography, constraint and angle functions
+// against central differences and known values; state initialisation and the motion prior;
+// block building; and whole levels on synthetic frames related by known homographies.
+#include <gtest/gtest.h>
+
+#include <cfloat>
+#include <cmath>
+#include <functional>
+#include <memory>
+#include <numbers>
+#include <vector>
+
+#include "plano/sumo_states.h"
+#include "plano/track.h"
+#include "plano/track_homography.h"
+#include "plano_host/host.h"
+
+namespace {
+
+int32_t origin_code()
+{
+    Plx_ErrorRecord record{};
+    return plx_err_get_error(0, &record) ? record.code : -1;
+}
+
+struct SumoFree {
+    void operator()(Sumo *s) const { vSumoFree(s, nullptr); }
+};
+using SumoPtr = std::unique_ptr<Sumo, SumoFree>;
+struct ImageFree {
+    void operator()(Plx_Image *i) const { plx_image_free(i); }
+};
+using ImagePtr = std::unique_ptr<Plx_Image, ImageFree>;
+struct HostFree {
+    void operator()(PlanoHost *h) const { plano_host_free(h); }
+};
+using HostPtr = std::unique_ptr<PlanoHost, HostFree>;
+
+SumoStateVector *make_state(Sumo *sumo, std::vector<double> x, int32_t type)
+{
+    SumoStateVector *s = pSumoStateVectorNew(sumo, sumo->root, uint32_t(x.size()), nullptr, nullptr);
+    Plx_Vector v;
+    plx_vec_form_data(&v, uint32_t(x.size()), x.data());
+    EXPECT_TRUE(bSumoStateVectorInit(sumo, s, &v));
+    s->x.type = type;
+    return s;
+}
+
+// A smooth, non-periodic texture in [0.1, 0.9].
+double texture(double x, double y)
+{
+    return 0.5 + 0.15 * std::sin(0.31 * x + 0.2 * y) + 0.12 * std::cos(0.23 * y - 0.11 * x + 1.0) +
+           0.1 * std::sin(0.47 * x) * std::cos(0.39 * y) + 0.08 * std::sin(0.13 * x + 0.61 * y);
+}
+
+// Float image sampling the texture at pixel centres (channel k shifted by 7k pixels).
+ImagePtr float_image(int32_t h, int32_t w, Plx_ImageFormat format)
+{
+    ImagePtr image(plx_image_form_gen(nullptr, format, PLX_TYPE_FLOAT, h, w));
+    const uint32_t ch = plx_image_format_channels(format);
+    for (int32_t r = 0; r < h; ++r)
+        for (int32_t c = 0; c < w; ++c)
+            for (uint32_t k = 0; k < ch; ++k)
+                static_cast<float *>(plx_image_row(image.get(), r))[c * ch + k] =
+                    float(texture(c + 0.5 + 7.0 * k, r + 0.5 - 3.0 * k));
+    return image;
+}
+
+// One pixel-match set-up: a Sumo with a homography state (and illumination), a block over a
+// float search image.
+struct PixelCase {
+    SumoPtr sumo{pSumoForm(nullptr, nullptr)};
+    ImagePtr search;
+    Plx_Image *mask = nullptr;
+    std::vector<float> positions;
+    TrackPixelBlock block{};
+    SumoStateVector *states[2] = {nullptr, nullptr};
+    Plx_Vector z{};
+    uint32_t channels = 1;
+
+    PixelCase(Plx_ImageFormat format, std::vector<double> params, int32_t type, double zh)
+    {
+        search = float_image(16, 16, format);
+        channels = format == PLX_FORMAT_GREY ? 1 : 3;
+        for (int y = 2; y <= 6; y += 2)
+            for (int x = 2; x <= 7; ++x) positions.insert(positions.end(), {x + 0.5f, y + 0.5f});
+        block = {zh, float(zh), search.get(), nullptr, positions.data(), uint32_t(positions.size() / 2)};
+        states[0] = make_state(sumo.get(), std::move(params), type);
+        states[1] = make_state(sumo.get(), {1.2, 0.1}, 0);
+        plx_vec_form(&z, block.no_pixels * channels);
+        for (uint32_t i = 0; i < z.rows; ++i) z.data[i] = 0.4 + 0.01 * i;
+    }
+    ~PixelCase()
+    {
+        plx_vec_free(&z);
+        plx_image_free(mask);
+    }
+    SumoVector zvec()
+    {
+        SumoVector v{};
+        v.v = z;
+        v.user_data = &block;
+        return v;
+    }
+};
+
+// Central differences of an h function against its analytic Jacobians, for every state.
+void expect_jacobians(SumoHFunction f, SumoStateVector **states, uint32_t n_states, const SumoVector &z,
+                      double step, double tolerance)
+{
+    const uint32_t m = z.v.rows;
+    std::vector<Plx_Matrix> J(n_states);
+    std::vector<Plx_Matrix *> Jp(n_states);
+    for (uint32_t s = 0; s < n_states; ++s) {
+        plx_mat_form(&J[s], m, states[s]->x.v.rows);
+        Jp[s] = &J[s];
+    }
+    Plx_Vector h0{}, hp{}, hm{};
+    plx_vec_form(&h0, m), plx_vec_form(&hp, m), plx_vec_form(&hm, m);
+    ASSERT_TRUE(f(nullptr, nullptr, states, n_states, &z, &h0, Jp.data()));
+    for (uint32_t s = 0; s < n_states; ++s) {
+        double *x = states[s]->x.v.data;
+        for (uint32_t k = 0; k < states[s]->x.v.rows; ++k) {
+            const double saved = x[k];
+            x[k] = saved + step;
+            ASSERT_TRUE(f(nullptr, nullptr, states, n_states, &z, &hp, nullptr));
+            x[k] = saved - step;
+            ASSERT_TRUE(f(nullptr, nullptr, states, n_states, &z, &hm, nullptr));
+            x[k] = saved;
+            for (uint32_t r = 0; r < m; ++r) {
+                const double numeric = (hp.data[r] - hm.data[r]) / (2 * step);
+                const double analytic = J[s].data[r * J[s].cols + k];
+                EXPECT_NEAR(analytic, numeric, tolerance * (1.0 + std::fabs(numeric)))
+                    << "state " << s << " parameter " << k << " row " << r;
+            }
+        }
+    }
+    for (auto &j : J) plx_mat_free(&j);
+    plx_vec_free(&h0), plx_vec_free(&hp), plx_vec_free(&hm);
+}
+
+struct PixelFunction {
+    const char *name;
+    SumoHFunction f;
+    Plx_ImageFormat format;
+    std::vector<double> params;  // at zh 2: the warp moves every pixel by about (0.3, 0.35)
+    int32_t type;
+};
+
+std::vector<PixelFunction> pixel_functions()
+{
+    const std::vector<double> affine = {1.0, 0.01, 0.15, -0.008, 1.0, 0.175};
+    const std::vector<double> proj = {1.0, 0.01, 0.15, -0.008, 1.0, 0.175, 0.0004, -0.0003, 1.0};
+    return {
+        {"affine", bPixelMatchAffineH, PLX_FORMAT_GREY, affine, TRACK_STATE_AFFINE},
+        {"proj", bPixelMatchProjH, PLX_FORMAT_GREY, proj, TRACK_STATE_PROJ},
+        {"translate", bPixelMatchTranslateH, PLX_FORMAT_GREY, {0.15, 0.175}, TRACK_STATE_TRANSLATE},
+        {"trs", bPixelMatchTransRotScaleH, PLX_FORMAT_GREY, {1.0, 0.15, 0.004, 0.175}, TRACK_STATE_TRANS_ROT_SCALE},
+        {"ts", bPixelMatchTransScaleH, PLX_FORMAT_GREY, {1.003, 0.15, 0.175}, TRACK_STATE_TRANS_SCALE},
+        {"affine rgb", bPixelMatchAffineRGBH, PLX_FORMAT_RGB, affine, TRACK_STATE_AFFINE},
+        {"proj rgba", bPixelMatchProjRGBH, PLX_FORMAT_RGBA, proj, TRACK_STATE_PROJ},
+        {"translate rgb", bPixelMatchTranslateRGBH, PLX_FORMAT_RGB, {0.15, 0.175}, TRACK_STATE_TRANSLATE},
+    };
+}
+
+TEST(TrackHomogPixelMatch, JacobiansMatchCentralDifferences)
+{
+    for (const PixelFunction &pf : pixel_functions()) {
+        SCOPED_TRACE(pf.name);
+        PixelCase pc(pf.format, pf.params, pf.type, 2.0);
+        SumoVector z = pc.zvec();
+        expect_jacobians(pf.f, pc.states, 2, z, 2e-4, 5e-3);
+        // Without the illumination state the prediction is the plain interpolation.
+        expect_jacobians(pf.f, pc.states, 1, z, 2e-4, 5e-3);
+    }
+}
+
+TEST(TrackHomogPixelMatch, PredictsBilinearValueWithGainAndOffset)
+{
+    // Translation (0.15, 0.175) at zh 2 moves pixel centre (2.5, 2.5) to (2.8, 2.85): cell
+    // (2, 2) with fractions (0.3, 0.35).
+    PixelCase pc(PLX_FORMAT_GREY, {0.15, 0.175}, TRACK_STATE_TRANSLATE, 2.0);
+    SumoVector z = pc.zvec();
+    Plx_Vector h{};
+    plx_vec_form(&h, z.v.rows);
+    ASSERT_TRUE(bPixelMatchTranslateH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr));
+    auto at = [&](int r, int c) { return double(static_cast<float *>(plx_image_row(pc.search.get(), r))[c]); };
+    const double fx = 0.3, fy = 0.35;
+    const double S = (1 - fy) * ((1 - fx) * at(2, 2) + fx * at(2, 3)) + fy * ((1 - fx) * at(3, 2) + fx * at(3, 3));
+    EXPECT_NEAR(h.data[0], 1.2 * S + 0.1, 1e-5);
+    plx_vec_free(&h);
+}
+
+TEST(TrackHomogPixelMatch, PixelsLeavingTheWindowOrMaskContributeNothing)
+{
+    for (const PixelFunction &pf : pixel_functions()) {
+        SCOPED_TRACE(pf.name);
+        PixelCase pc(pf.format, pf.params, pf.type, 2.0);
+        // Pixel 0 lands past the right edge, pixel 1 left of the image; pixel 2 needs a
+        // search pixel that the mask clears.
+        pc.positions[0] = 15.6f;
+        pc.positions[2] = -0.4f;
+        pc.mask = plx_image_form_gen_b(nullptr, 16, 16);
+        const double one = 1.0;
+        plx_image_fill_const(pc.mask, &one);
+        // Pixel 2 at (4.5, 2.5) reads cell (4, 2) of the search image, pixel 3 cell (5, 2).
+        plx_image_set_bit(pc.mask, 3, 4, 0);
+        pc.block.search_mask = pc.mask;
+        SumoVector z = pc.zvec();
+        const uint32_t m = z.v.rows, C = pc.channels;
+        Plx_Matrix J0{}, J1{};
+        plx_mat_form(&J0, m, pc.states[0]->x.v.rows);
+        plx_mat_form(&J1, m, 2);
+        for (uint32_t i = 0; i < m * J0.cols; ++i) J0.data[i] = 99.0;
+        for (uint32_t i = 0; i < m * 2; ++i) J1.data[i] = 99.0;
+        Plx_Matrix *J[2] = {&J0, &J1};
+        Plx_Vector h{};
+        plx_vec_form(&h, m);
+        ASSERT_TRUE(pf.f(nullptr, nullptr, pc.states, 2, &z, &h, J));
+        for (uint32_t p = 0; p < 4; ++p)
+            for (uint32_t ch = 0; ch < C; ++ch) {
+                const uint32_t r = p * C + ch;
+                const bool dropped = p < 3;
+                if (dropped) {
+                    EXPECT_EQ(h.data[r], z.v.data[r]) << "pixel " << p;
+                    for (uint32_t k = 0; k < J0.cols; ++k) EXPECT_EQ(J0.data[r * J0.cols + k], 0.0);
+                    EXPECT_EQ(J1.data[2 * r], 0.0);
+                    EXPECT_EQ(J1.data[2 * r + 1], 0.0);
+                } else {
+                    EXPECT_NE(h.data[r], z.v.data[r]);
+                    EXPECT_EQ(J1.data[2 * r + 1], 1.0);
+                }
+            }
+        plx_mat_free(&J0), plx_mat_free(&J1), plx_vec_free(&h);
+    }
+}
+
+TEST(TrackHomogPixelMatch, RejectsBlocksThatDoNotFit)
+{
+    PixelCase pc(PLX_FORMAT_RGB, {0.15, 0.175}, TRACK_STATE_TRANSLATE, 2.0);
+    SumoVector z = pc.zvec();
+    Plx_Vector h{};
+    plx_vec_form(&h, z.v.rows);
+    // A grey function over an RGB image, and a z that is not three values per pixel.
+    EXPECT_FALSE(bPixelMatchTranslateH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr));
+    z.v.rows -= 1;
+    EXPECT_FALSE(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_INCOMPATIBLE);
+    EXPECT_FALSE(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, nullptr, &h, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    plx_vec_free(&h);
+}
+
+// ---- states and homography observations ----
+
+Plx_Matrix33 mat33(std::initializer_list<double> v)
+{
+    Plx_Matrix33 H{};
+    int i = 0;
+    for (double x : v) H.m[i / 3][i % 3] = x, ++i;
+    return H;
+}
+
+TEST(TrackHomogStates, MotionInitReadsBackEachModel)
+{
+    struct Case {
+        uint32_t model;
+        Plx_Matrix33 H;
+        Plx_Matrix33 expected;
+    };
+    const Case cases[] = {
+        {TRACK_MODEL_AFFINE, mat33({2.2, 0.2, 6, -0.4, 1.8, 8, 0, 0, 2}), mat33({1.1, 0.1, 3, -0.2, 0.9, 4, 0, 0, 1})},
+        {TRACK_MODEL_TRANSLATE, mat33({1, 0, 3, 0, 1, -4, 0, 0, 1}), mat33({1, 0, 3, 0, 1, -4, 0, 0, 1})},
+        {TRACK_MODEL_TRANS_ROT_SCALE, mat33({2, -0.4, 6, 0.4, 2, 8, 0, 0, 2}), mat33({1, -0.2, 3, 0.2, 1, 4, 0, 0, 1})},
+        {TRACK_MODEL_TRANS_SCALE, mat33({3, 0, 6, 0, 3, 9, 0, 0, 3}), mat33({1, 0, 2, 0, 1, 3, 0, 0, 1})},
+        {TRACK_MODEL_PROJ, mat33({3, 0, 0, 0, 4, 0, 0, 0, 0}), mat33({0.6, 0, 0, 0, 0.8, 0, 0, 0, 0})},
+    };
+    for (const Case &c : cases) {
+        SCOPED_TRACE(c.model);
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        ASSERT_TRUE(bMotionInit(sumo.get(), s, c.model, &c.H));
+        Plx_Matrix33 back;
+        ASSERT_TRUE(bPixelMatchMatRead(s, &back));
+        for (int i = 0; i < 9; ++i) EXPECT_NEAR(back.m[i / 3][i % 3], c.expected.m[i / 3][i % 3], 1e-12) << i;
+    }
+}
+
+TEST(TrackHomogStates, MotionInitRefusesWrongShapes)
+{
+    struct Case {
+        uint32_t model;
+        Plx_Matrix33 H;
+        int32_t code;
+    };
+    const Case cases[] = {
+        {TRACK_MODEL_AFFINE, mat33({1, 0, 0, 0, 1, 0, 0.001, 0, 1}), PLX_ERROR_INCOMPATIBLE},
+        {TRACK_MODEL_AFFINE, mat33({1, 0, 0, 0, 1, 0, 0, 0, 0}), PLX_ERROR_INCOMPATIBLE},
+        {TRACK_MODEL_TRANSLATE, mat33({1.01, 0, 0, 0, 1.01, 0, 0, 0, 1}), PLX_ERROR_INCOMPATIBLE},
+        {TRACK_MODEL_TRANS_ROT_SCALE, mat33({1, 0.1, 0, 0.1, 1, 0, 0, 0, 1}), PLX_ERROR_INCOMPATIBLE},
+        {TRACK_MODEL_TRANS_SCALE, mat33({1, 0.1, 0, -0.1, 1, 0, 0, 0, 1}), PLX_ERROR_INCOMPATIBLE},
+        {7u, mat33({1, 0, 0, 0, 1, 0, 0, 0, 1}), PLX_ERROR_ILLEGAL_TYPE},
+    };
+    for (const Case &c : cases) {
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        EXPECT_FALSE(bMotionInit(sumo.get(), s, c.model, &c.H));
+        EXPECT_EQ(origin_code(), c.code) << c.model;
+    }
+    SumoPtr sumo(pSumoForm(nullptr, nullptr));
+    SumoStateVector *s = make_state(sumo.get(), {1, 2}, 12345);
+    Plx_Matrix33 H;
+    EXPECT_FALSE(bPixelMatchMatRead(s, &H));
+    EXPECT_EQ(origin_code(), PLX_ERROR_CALLEE);
+}
+
+// A homography observation made from the homography the state starts at has zero residual,
+// and its h function is the identity on the parameters (their offset from the start for the
+// projective state).
+TEST(TrackHomogStates, HomographyObservationHoldsTheStartingMotion)
+{
+    const std::pair<uint32_t, Plx_Matrix33> cases[] = {
+        {TRACK_MODEL_AFFINE, mat33({2.2, 0.2, 6, -0.4, 1.8, 8, 0, 0, 2})},
+        {TRACK_MODEL_TRANSLATE, mat33({1, 0, 3, 0, 1, -4, 0, 0, 1})},
+        {TRACK_MODEL_TRANS_ROT_SCALE, mat33({2, -0.4, 6, 0.4, 2, 8, 0, 0, 2})},
+        {TRACK_MODEL_TRANS_SCALE, mat33({3, 0, 6, 0, 3, 9, 0, 0, 3})},
+        {TRACK_MODEL_PROJ, mat33({1.1, 0.1, 5, -0.1, 0.9, 3, 0.001, 0.002, 1})},
+    };
+    for (const auto &[model, H] : cases) {
+        SCOPED_TRACE(model);
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        ASSERT_TRUE(bMotionInit(sumo.get(), s, model, &H));
+        const uint32_t n = s->x.v.rows;
+        Plx_SquMatrix *info = plx_squmat_new(PLX_SQUMAT_SCALED_IDENTITY, n);
+        info->data[0] = 4.0;
+        SumoObs *obs = nullptr;
+        ASSERT_TRUE(bHomogObs(sumo.get(), s, model, &H, info, nullptr, &obs));
+        SumoWorkspace *ws = pSumoWorkspaceForm(nullptr);
+        EXPECT_NEAR(dSumoObsComputeResidual(sumo.get(), ws, obs), 0.0, 1e-20);
+        expect_jacobians(obs->func.h, &s, 1, obs->z, 1e-3, 1e-9);
+        // Moving parameter 0 by 0.5 costs 4 * 0.25.
+        s->x.v.data[0] += 0.5;
+        EXPECT_NEAR(dSumoObsComputeResidual(sumo.get(), ws, obs), 1.0, 1e-12);
+        vSumoWorkspaceFree(ws);
+        plx_squmat_free(info);
+    }
+}
+
+// The motion prior's information against its formula, written out plainly.
+TEST(TrackHomogStates, MotionPriorMatchesItsFormula)
+{
+    const double w = 0.2, zh = 1.5;
+    const uint32_t height = 40, width = 60;
+    const double a = std::pow(0.5 / w, 2), tx = std::pow(zh / width / w, 2), ty = std::pow(zh / height / w, 2);
+    {
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        const Plx_Matrix33 H = mat33({1.1, 0.1, 5, -0.1, 0.9, 3, 0, 0, 1});
+        ASSERT_TRUE(bMotionInit(sumo.get(), s, TRACK_MODEL_AFFINE, &H));
+        ASSERT_TRUE(bAddHomogObs(sumo.get(), s, TRACK_MODEL_AFFINE, &H, w, height, width, zh, nullptr));
+        const double d[6] = {a, a, tx, a, a, ty};
+        for (uint32_t i = 0; i < 6; ++i)
+            for (uint32_t j = 0; j < 6; ++j)
+                EXPECT_NEAR(plx_squmat_get(&sumo->obs_active->N, i, j), i == j ? d[i] : 0.0, 1e-12);
+    }
+    {
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+        const Plx_Matrix33 H = mat33({2.2, 0.2, 10, -0.2, 1.8, 6, 0.002, 0.004, 2});
+        ASSERT_TRUE(bMotionInit(sumo.get(), s, TRACK_MODEL_PROJ, &H));
+        ASSERT_TRUE(bAddHomogObs(sumo.get(), s, TRACK_MODEL_PROJ, &H, w, height, width, zh, nullptr));
+        double h[9], norm2 = 0;
+        for (int i = 0; i < 9; ++i) h[i] = H.m[i / 3][i % 3] / 2.0, norm2 += h[i] * h[i];
+        const double dd = std::pow(std::min(std::fabs(h[1]) * height + std::fabs(h[0]) * width,
+                                            std::fabs(h[4]) * height + std::fabs(h[3]) * width) *
+                                       0.25 / w / zh,
+                                   2);
+        const double diag[8] = {a, a, tx, a, a, ty, dd, dd};
+        double e = 0;
+        for (int i = 0; i < 8; ++i) e += h[i] * h[i] * diag[i];
+        double P[9][9] = {};
+        for (int i = 0; i < 8; ++i) {
+            P[i][i] = diag[i];
+            P[8][i] = P[i][8] = -h[i] * diag[i];
+        }
+        P[8][8] = e;
+        const Plx_SquMatrix *N = &sumo->obs_active->N;
+        for (int i = 0; i < 9; ++i)
+            for (int j = 0; j < 9; ++j)
+                EXPECT_NEAR(plx_squmat_get(N, i, j), P[i][j] * norm2, 1e-9 * (1 + std::fabs(P[i][j]))) << i << j;
+        // The homography itself is its null direction: the prior leaves the scale free.
+        for (int i = 0; i < 9; ++i) {
+            double sum = 0;
+            for (int j = 0; j < 9; ++j) sum += plx_squmat_get(N, i, j) * h[j];
+            EXPECT_NEAR(sum, 0.0, 1e-9);
+        }
+    }
+    SumoPtr sumo(pSumoForm(nullptr, nullptr));
+    SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, nullptr, nullptr);
+    const Plx_Matrix33 I = mat33({1, 0, 0, 0, 1, 0, 0, 0, 1});
+    ASSERT_TRUE(bMotionInit(sumo.get(), s, TRACK_MODEL_TRANSLATE, &I));
+    EXPECT_FALSE(bAddHomogObs(sumo.get(), s, TRACK_MODEL_TRANSLATE, &I, 0.0, height, width, zh, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_FALSE(bAddHomogObs(sumo.get(), s, TRACK_MODEL_TRANSLATE, &I, w, 0, width, zh, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+}
+
+// ---- block observations ----
+
+struct BlockCase {
+    SumoPtr sumo{pSumoForm(nullptr, nullptr)};
+    Plx_MemoryStack ms{};
+    ImagePtr image;
+    TrackPixelObsJob job{};
+    BlockCase(Plx_ImageFormat format, uint32_t model, int32_t size)
+    {
+        plx_memory_stack_form(&ms, 0, 1 << 16);
+        image = float_image(size, size, format);
+        SumoStateVector *s = pSumoStateVectorNew(sumo.get(), sumo->root, 9, &ms, nullptr);
+        const Plx_Matrix33 I = mat33({1, 0, 0, 0, 1, 0, 0, 0, 1});
+        EXPECT_TRUE(bMotionInit(sumo.get(), s, model, &I));
+        job.sumo = sumo.get();
+        job.ms = &ms;
+        job.homography_state = s;
+        job.model = model;
+        job.reference = job.search = image.get();
+        job.zh = 1.0;
+        job.block_size = 2;
+        job.sampling = 1;
+        job.intensity_sigma = 0.5;
+    }
+    ~BlockCase()
+    {
+        sumo.reset();
+        plx_memory_stack_free(&ms);
+    }
+    std::vector<uint32_t> counts() const
+    {
+        std::vector<uint32_t> n;
+        for (uint32_t i = 0; i < job.no_obs; ++i) n.push_back(job.blocks[i].no_pixels);
+        return n;
+    }
+};
+
+TEST(TrackHomogBlocks, BlocksFollowSizeSamplingMaskAndTexture)
+{
+    {
+        BlockCase bc(PLX_FORMAT_GREY, TRACK_MODEL_AFFINE, 5);
+        ASSERT_TRUE(bBuildPixelObservations(&bc.job, nullptr));
+        EXPECT_EQ(bc.job.blocks_across, 3u);
+        EXPECT_EQ(bc.job.blocks_down, 3u);
+        EXPECT_EQ(bc.counts(), (std::vector<uint32_t>{4, 4, 2, 4, 4, 2, 2, 2, 1}));
+        // Block (1, 0) covers columns 2..3 of rows 0..1; values and N come from the pixels.
+        const TrackPixelBlock &b = bc.job.blocks[1];
+        EXPECT_EQ(b.positions[0], 2.5f);
+        EXPECT_EQ(b.positions[1], 0.5f);
+        EXPECT_EQ(bc.job.obs[1]->z.v.data[0], double(static_cast<float *>(plx_image_row(bc.image.get(), 0))[2]));
+        EXPECT_NEAR(plx_squmat_get(&bc.job.obs[1]->N, 3, 3), 4.0, 1e-12);
+        EXPECT_EQ(bc.job.obs[1]->kind, SUMO_OBS_H);
+    }
+    {
+        BlockCase bc(PLX_FORMAT_GREY, TRACK_MODEL_AFFINE, 5);
+        bc.job.sampling = 2;  // checkerboard: 13 of 25
+        bc.job.robust_scale = 3.0;
+        bc.job.outlier_cutoff = 2.0;
+        ASSERT_TRUE(bBuildPixelObservations(&bc.job, nullptr));
+        EXPECT_EQ(bc.counts(), (std::vector<uint32_t>{2, 2, 1, 2, 2, 1, 1, 1, 1}));
+        EXPECT_EQ(bc.job.obs[0]->kind, SUMO_OBS_H_ROBUST);
+        EXPECT_DOUBLE_EQ(bc.job.obs[0]->variance_scaling, 9.0);
+        EXPECT_DOUBLE_EQ(bc.job.obs[0]->chi2_cutoff, 4.0);
+    }
+    {
+        BlockCase bc(PLX_FORMAT_RGB, TRACK_MODEL_PROJ, 5);
+        bc.job.sampling = 4;  // grid of step 2: one pixel per 2x2 block
+        Plx_Image *mask = plx_image_form_gen_b(nullptr, 5, 5);
+        const double one = 1.0;
+        plx_image_fill_const(mask, &one);
+        plx_image_set_bit(mask, 2, 2, 0);
+        bc.job.reference_mask = mask;
+        ASSERT_TRUE(bBuildPixelObservations(&bc.job, nullptr));
+        EXPECT_EQ(bc.counts(), (std::vector<uint32_t>{1, 1, 1, 1, 1, 1, 1, 1}));
+        EXPECT_EQ(bc.job.obs[0]->z.v.rows, 3u);
+        plx_image_free(mask);
+    }
+    {
+        // A flat image has no pixel textured enough.
+        BlockCase bc(PLX_FORMAT_GREY, TRACK_MODEL_TRANSLATE, 6);
+        const double half = 0.5;
+        plx_image_fill_const(bc.image.get(), &half);
+        bc.job.texture_threshold = 0.01;
+        ASSERT_TRUE(bBuildPixelObservations(&bc.job, nullptr));
+        EXPECT_EQ(bc.job.no_obs, 0u);
+    }
+}
+
+TEST(TrackHomogBlocks, RefusesColourModelsWithoutAFunction)
+{
+    BlockCase bc(PLX_FORMAT_RGB, TRACK_MODEL_TRANS_SCALE, 5);
+    EXPECT_FALSE(bBuildPixelObservations(&bc.job, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    BlockCase grey(PLX_FORMAT_GREY, TRACK_MODEL_AFFINE, 5);
+    grey.job.intensity_sigma = 0.0;
+    EXPECT_FALSE(bBuildPixelObservations(&grey.job, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+}
+
+// ---- constraint points and angles ----
+
+TEST(TrackHomogConstraints, PointFunctionsMatchCentralDifferences)
+{
+    const std::pair<std::vector<double>, int32_t> states[] = {
+        {{1.0, 0.02, 3.0, -0.01, 0.98, 2.0, 0.001, -0.002, 1.0}, TRACK_STATE_PROJ},
+        {{1.01, 3.0, 0.02, 2.0}, TRACK_STATE_TRANS_ROT_SCALE},
+        {{0.99, 3.0, 2.0}, TRACK_STATE_TRANS_SCALE},
+        {{3.0, 2.0}, TRACK_STATE_TRANSLATE},
+    };
+    for (const auto &[x, type] : states) {
+        SCOPED_TRACE(type);
+        SumoPtr sumo(pSumoForm(nullptr, nullptr));
+        SumoStateVector *s[2] = {make_state(sumo.get(), x, type), make_state(sumo.get(), {14.0, 9.0}, 257)};
+        double zh = 2.0;
+        double z2[4] = {5.0, 7.0, 11.0, 13.0};
+        SumoVector zv{};
+        plx_vec_form_data(&zv.v, 4, z2);
+        zv.user_data = &zh;
+        TrackConstraintPointData data{2.0, 2.0f, {1.5, -2.5}};
+        SumoVector zo{};
+        plx_vec_form_data(&zo.v, 2, z2);
+        zo.user_data = &data;
+        struct Fn {
+            SumoFFunction f;
+            SumoVector *z;
+            uint32_t n;
+        } fns[] = {{bConstraintPointTwoImagesF, &zv, 1}, {bConstraintPointOneImageF, &zo, 2}};
+        for (const Fn &fn : fns) {
+            const uint32_t m = fn.z->v.rows;
+            Plx_Vector F{}, Fp{}, Fm{};
+            plx_vec_form(&F, m), plx_vec_form(&Fp, m), plx_vec_form(&Fm, m);
+            Plx_Matrix J0{}, J1{}, Fz{};
+            plx_mat_form(&J0, m, s[0]->x.v.rows), plx_mat_form(&J1, m, 2), plx_mat_form(&Fz, m, m);
+            Plx_Matrix *J[2] = {&J0, &J1};
+            ASSERT_TRUE(fn.f(nullptr, nullptr, s, fn.n, fn.z, &F, J, &Fz));
+            ASSERT_EQ(F.rows, 2u);
+            ASSERT_EQ(Fz.rows, 2u);
+            ASSERT_EQ(Fz.cols, m);
+            const double step = 1e-6;
+            auto check = [&](double &v, auto analytic) {
+                const double saved = v;
+                v = saved + step;
+                ASSERT_TRUE(fn.f(nullptr, nullptr, s, fn.n, fn.z, &Fp, nullptr, nullptr));
+                v = saved - step;
+                ASSERT_TRUE(fn.f(nullptr, nullptr, s, fn.n, fn.z, &Fm, nullptr, nullptr));
+                v = saved;
+                for (uint32_t r = 0; r < 2; ++r)
+                    EXPECT_NEAR(analytic(r), (Fp.data[r] - Fm.data[r]) / (2 * step), 1e-6);
+            };
+            for (uint32_t k = 0; k < s[0]->x.v.rows; ++k)
+                check(s[0]->x.v.data[k], [&](uint32_t r) { return J0.data[r * J0.cols + k]; });
+            if (fn.n == 2)
+                for (uint32_t k = 0; k < 2; ++k)
+                    check(s[1]->x.v.data[k], [&](uint32_t r) { return J1.data[r * 2 + k]; });
+            for (uint32_t k = 0; k < m; ++k) check(fn.z->v.data[k], [&](uint32_t r) { return Fz.data[r * m + k]; });
+            plx_vec_free(&F), plx_vec_free(&Fp), plx_vec_free(&Fm);
+            plx_mat_free(&J0), plx_mat_free(&J1), plx_mat_free(&Fz);
+        }
+    }
+}
+
+TEST(TrackHomogConstraints, AngleValueDerivativesAndDegenerateCases)
+{
+    const double P[2] = {0, 0}, A[2] = {1, 0}, B[2] = {0, 1};
+    double angle = 0, d[6];
+    ASSERT_TRUE(bCalcConstraintAngle(P, A, B, 0.0, &angle, d, nullptr));
+    EXPECT_NEAR(angle, -std::numbers::pi / 2, 1e-15);
+
+    // Derivatives against central differences at a general configuration.
+    double pts[6] = {1.0, 2.0, 4.0, 3.5, -0.5, 6.0};
+    ASSERT_TRUE(bCalcConstraintAngle(pts, pts + 2, pts + 4, 0.0, &angle, d, nullptr));
+    for (int k = 0; k < 6; ++k) {
+        const double saved = pts[k], step = 1e-6;
+        double ap, am;
+        pts[k] = saved + step;
+        bCalcConstraintAngle(pts, pts + 2, pts + 4, 0.0, &ap, nullptr, nullptr);
+        pts[k] = saved - step;
+        bCalcConstraintAngle(pts, pts + 2, pts + 4, 0.0, &am, nullptr, nullptr);
+        pts[k] = saved;
+        EXPECT_NEAR(d[k], (ap - am) / (2 * step), 1e-7) << k;
+    }
+
+    // Coinciding points: code 18 in the trace, or 29 in the caller's slot with the trace left alone.
+    EXPECT_FALSE(bCalcConstraintAngle(P, P, B, 0.0, &angle, d, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    plx_err_flush_trace();
+    int32_t code = 0;
+    EXPECT_FALSE(bCalcConstraintAngle(P, A, B, 1.5, &angle, d, &code));
+    EXPECT_EQ(code, PLX_ERROR_UNDEFINED_ANGLE);
+    EXPECT_EQ(plx_err_get_error_count(), 0u);
+
+    // The observation function: prediction within pi of z, Jacobians matching.
+    SumoPtr sumo(pSumoForm(nullptr, nullptr));
+    // u = (-4, 0.1), v = (4, 0.1): the raw angle is just below +pi.
+    SumoStateVector *s[3] = {make_state(sumo.get(), {1.0, 2.0}, 257), make_state(sumo.get(), {-3.0, 2.1}, 257),
+                             make_state(sumo.get(), {5.0, 2.1}, 257)};
+    double zval = -3.0, threshold = 0.0;
+    SumoVector z{};
+    plx_vec_form_data(&z.v, 1, &zval);
+    z.user_data = &threshold;
+    Plx_Vector h{};
+    plx_vec_form(&h, 1);
+    ASSERT_TRUE(bAngleConstraintH(nullptr, nullptr, s, 3, &z, &h, nullptr));
+    const double raw = std::atan2(0.8, -15.99);
+    EXPECT_NEAR(h.data[0], raw - 2 * std::numbers::pi, 1e-12);
+    expect_jacobians(bAngleConstraintH, s, 3, z, 1e-6, 1e-6);
+    plx_vec_free(&h);
+}
+
+// ---- whole levels on synthetic frames ----
+
+Plx_Matrix33 mult(const Plx_Matrix33 &A, const Plx_Matrix33 &B)
+{
+    Plx_Matrix33 C;
+    plx_mat33_rmultm33_s(&A, &B, &C);
+    return C;
+}
+
+Plx_Matrix33 about_centre(const Plx_Matrix33 &L, double cx, double cy, double tx, double ty)
+{
+    return mult(mat33({1, 0, cx + tx, 0, 1, cy + ty, 0, 0, 1}), mult(L, mat33({1, 0, -cx, 0, 1, -cy, 0, 0, 1})));
+}
+
+void apply(const Plx_Matrix33 &H, double x, double y, double *u, double *v)
+{
+    const double X = H.m[0][0] * x + H.m[0][1] * y + H.m[0][2];
+    const double Y = H.m[1][0] * x + H.m[1][1] * y + H.m[1][2];
+    const double Z = H.m[2][0] * x + H.m[2][1] * y + H.m[2][2];
+    *u = X / Z, *v = Y / Z;
+}
+
+constexpr int32_t kSize = 96, kBox0 = 28, kBox = 40, kSearch = 8;
+
+// Two frames: the previous samples the texture, the current samples it moved by H.
+struct Frames {
+    ImagePtr previous, current;
+    ImagePtr mask;
+    Plx_Camera camera{};
+    explicit Frames(const Plx_Matrix33 &H, double (*tex)(double, double) = texture)
+    {
+        previous.reset(plx_image_form_gen_gl_f(nullptr, kSize, kSize));
+        current.reset(plx_image_form_gen_gl_f(nullptr, kSize, kSize));
+        Plx_Matrix33 Hinv;
+        plx_mat33_invert_s(&H, &Hinv);
+        for (int32_t r = 0; r < kSize; ++r)
+            for (int32_t c = 0; c < kSize; ++c) {
+                double x, y;
+                apply(Hinv, c + 0.5, r + 0.5, &x, &y);
+                static_cast<float *>(plx_image_row(previous.get(), r))[c] = float(tex(c + 0.5, r + 0.5));
+                static_cast<float *>(plx_image_row(current.get(), r))[c] = float(tex(x, y));
+            }
+        mask.reset(plx_image_form_gen_b(nullptr, kSize, kSize));
+        plx_image_fill_zero(mask.get());
+        const double one = 1.0;
+        plx_image_fill_const_window(mask.get(), Plx_Window{kBox0, kBox0, kBox, kBox}, &one);
+        plx_camera_build_linear(&camera, 1.0, 1.0, 1.0, 0.0, 0.0);
+    }
+};
+
+struct Settings {
+    uint32_t model = TRACK_MODEL_AFFINE;
+    double texture_threshold = 0.0;
+    uint32_t min_pixel_count = 10;
+    double max_rejected_fraction = 0.0;
+    double robust_scale = 0.0;
+    double outlier_cutoff = 0.0;
+    uint32_t levels = 2;
+};
+
+struct TrackFree {
+    void operator()(Track *t) const { vTrackFree(t); }
+};
+using TrackPtr = std::unique_ptr<Track, TrackFree>;
+
+TrackRegion *add_region(Track *track, Frames &f, const Settings &s, const ThreadHostInterface *host)
+{
+    const Plx_Matrix33 I = mat33({1, 0, 0, 0, 1, 0, 0, 0, 1});
+    return pTrackRegion(track, f.mask.get(), f.previous.get(), &f.camera, nullptr, nullptr, &I, nullptr, nullptr, 0.0,
+                        TRACK_NO_CORRELATION, 0.0, 0.0, 1.0, kSearch, kSearch, s.model, 0.5, s.texture_threshold, 0.0,
+                        s.min_pixel_count, 0.0, 1, s.max_rejected_fraction, 1, 0.0, 8, 0.01, s.robust_scale,
+                        s.outlier_cutoff, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr,
+                        nullptr, host);
+}
+
+TrackPtr make_track(Frames &f, const Settings &s, const ThreadHostInterface *host = nullptr)
+{
+    TrackPtr track(pTrackNew(f.previous.get(), &f.camera, f.current.get(), &f.camera, s.levels, nullptr));
+    EXPECT_NE(track, nullptr);
+    EXPECT_NE(add_region(track.get(), f, s, host), nullptr);
+    return track;
+}
+
+// Largest distance, over the region's corners, between where the region's window homography
+// and the true one carry a reference point.
+double corner_error(const TrackRegion *region, const Plx_Matrix33 &truth, int32_t x0 = kBox0, int32_t y0 = kBox0,
+                    int32_t size = kBox)
+{
+    double worst = 0;
+    for (double y : {double(y0), double(y0 + size)})
+        for (double x : {double(x0), double(x0 + size)}) {
+            double u, v, ue, ve;
+            apply(truth, x, y, &u, &v);
+            apply(region->homography, x - region->template_origin[0], y - region->template_origin[1], &ue, &ve);
+            worst = std::max(worst, std::hypot(ue + region->search_origin[0] - u, ve + region->search_origin[1] - v));
+        }
+    return worst;
+}
+
+TEST(TrackHomogMatch, RecoversKnownMotionForEveryModel)
+{
+    const double c = kBox0 + kBox / 2.0, th = 0.02;
+    const struct {
+        uint32_t model;
+        Plx_Matrix33 H;
+    } cases[] = {
+        {TRACK_MODEL_TRANSLATE, mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1})},
+        {TRACK_MODEL_TRANS_SCALE, about_centre(mat33({1.02, 0, 0, 0, 1.02, 0, 0, 0, 1}), c, c, 0.8, 0.5)},
+        {TRACK_MODEL_TRANS_ROT_SCALE,
+         about_centre(mat33({1.01 * std::cos(th), -1.01 * std::sin(th), 0, 1.01 * std::sin(th), 1.01 * std::cos(th), 0,
+                             0, 0, 1}),
+                      c, c, -0.9, 1.1)},
+        {TRACK_MODEL_AFFINE, about_centre(mat33({1.02, 0.015, 0, -0.01, 0.985, 0, 0, 0, 1}), c, c, 1.2, 0.6)},
+        {TRACK_MODEL_PROJ, about_centre(mat33({1.015, 0.01, 0, -0.01, 0.99, 0, 2e-4, -1.5e-4, 1}), c, c, 0.7, -1.0)},
+    };
+    for (const auto &cs : cases) {
+        SCOPED_TRACE(cs.model);
+        Frames f(cs.H);
+        Settings s;
+        s.model = cs.model;
+        TrackPtr track = make_track(f, s);
+        auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+        EXPECT_GT(corner_error(region, cs.H), 0.5);
+        ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, nullptr, nullptr));
+        EXPECT_LT(corner_error(region, cs.H), 0.05);
+        EXPECT_EQ(region->status, TRACK_REGION_OK);
+        // Bilinear interpolation flattens the search samples a little; the gain makes up for it.
+        EXPECT_NEAR(region->gain, 1.0, 0.04);
+        EXPECT_NEAR(region->offset, 0.0, 0.02);
+        EXPECT_LT(region->rms_residual, 3.0);
+        EXPECT_EQ(region->rejected_fraction, 0.0);
+        ASSERT_NE(region->observation_mask, nullptr);
+        EXPECT_GT(plx_image_bit_count(region->observation_mask), 1000u);
+        const uint32_t params[5] = {6, 9, 2, 4, 3};
+        EXPECT_EQ(region->information->size, params[cs.model]);
+        EXPECT_GT(plx_squmat_get(region->information, 0, 0), 0.0);
+        EXPECT_EQ(region->state, nullptr);
+    }
+}
+
+// Two regions handed the same caller buffers: each keeps its own pixel images.
+TEST(TrackHomogMatch, RegionsSharingBuffersTrackIndependently)
+{
+    const double c = kBox0 + kBox / 2.0;
+    const Plx_Matrix33 H = about_centre(mat33({1.01, 0.01, 0, -0.01, 0.99, 0, 0, 0, 1}), c, c, 0.9, -0.6);
+    Frames f(H);
+    TrackPtr track(pTrackNew(f.previous.get(), &f.camera, f.current.get(), &f.camera, 2, nullptr));
+    ImagePtr mask_b(plx_image_form_gen_b(nullptr, kSize, kSize));
+    plx_image_fill_zero(mask_b.get());
+    const double one = 1.0;
+    plx_image_fill_const_window(mask_b.get(), Plx_Window{10, 56, 30, 30}, &one);
+    ImagePtr corr(plx_image_form_gen_gl_f(nullptr, 1, 1)), tmpl(plx_image_form_gen_gl_f(nullptr, 1, 1));
+    const Plx_Matrix33 I = mat33({1, 0, 0, 0, 1, 0, 0, 0, 1});
+    for (Plx_Image *mask : {f.mask.get(), mask_b.get()})
+        ASSERT_NE(pTrackRegion(track.get(), mask, f.previous.get(), &f.camera, nullptr, nullptr, &I, nullptr, nullptr,
+                               0.0, TRACK_NO_CORRELATION, 0.0, 0.0, 1.0, kSearch, kSearch, TRACK_MODEL_AFFINE, 0.5, 0.0,
+                               0.0, 10, 0.0, 1, 0.0, 1, 0.0, 8, 0.01, 0.0, 0.0, corr.get(), tmpl.get(), nullptr,
+                               nullptr, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr),
+                  nullptr);
+    ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, nullptr, nullptr));
+    auto *b = static_cast<TrackRegion *>(track->regions->head->data);
+    auto *a = static_cast<TrackRegion *>(track->regions->head->next->data);
+    EXPECT_LT(corner_error(a, H), 0.05);
+    EXPECT_LT(corner_error(b, H, 10, 56, 30), 0.05);
+}
+
+TEST(TrackHomogMatch, NoIterationsKeepsTheMotionButMakesStatistics)
+{
+    Frames f(mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1}));
+    Settings s;
+    s.levels = 1;
+    TrackPtr track = make_track(f, s);
+    auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+    const Plx_Matrix33 before = region->homography;
+    ASSERT_TRUE(bMatchImages(track.get(), 0, 1e-3, 10.0, 0, nullptr, nullptr));
+    for (int i = 0; i < 9; ++i) EXPECT_EQ(region->homography.m[i / 3][i % 3], before.m[i / 3][i % 3]);
+    ASSERT_NE(region->observation_mask, nullptr);
+    EXPECT_EQ(plx_image_bit_count(region->observation_mask), uint32_t(kBox * kBox));
+    EXPECT_GT(region->rms_residual, 1.0);
+    EXPECT_LT(region->rms_residual, DBL_MAX);
+    EXPECT_EQ(region->rejected_fraction, 0.0);
+    EXPECT_EQ(region->status, TRACK_REGION_OK);
+}
+
+double flat(double, double) { return 0.5; }
+
+TEST(TrackHomogMatch, TexturelessRegionHasTooFewPixels)
+{
+    Frames f(mat33({1, 0, 0, 0, 1, 0, 0, 0, 1}), flat);
+    Settings s;
+    s.texture_threshold = 0.01;
+    TrackPtr track = make_track(f, s);
+    auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+    ASSERT_TRUE(bTrackHomogOptimise(track.get(), 5, 1e-3, 10.0, nullptr, nullptr));
+    EXPECT_EQ(region->status, TRACK_REGION_TOO_FEW_PIXELS);
+    EXPECT_EQ(region->rms_residual, DBL_MAX);
+    EXPECT_EQ(region->rejected_fraction, DBL_MAX);
+}
+
+// The current frame with a bright square over part of the region: the blocks it covers
+// become outliers.
+TEST(TrackHomogMatch, RejectedFractionChangesStatusOnlyWithAMaximum)
+{
+    const Plx_Matrix33 H = mat33({1, 0, 0.6, 0, 1, -0.4, 0, 0, 1});
+    for (double maximum : {0.0, 0.01}) {
+        SCOPED_TRACE(maximum);
+        Frames f(H);
+        const double bright = 0.95;
+        plx_image_fill_const_window(f.current.get(), Plx_Window{kBox0 + 4, kBox0 + 4, 12, 12}, &bright);
+        Settings s;
+        s.model = TRACK_MODEL_TRANSLATE;
+        s.robust_scale = 10.0;
+        s.outlier_cutoff = 9.0;
+        s.max_rejected_fraction = maximum;
+        TrackPtr track = make_track(f, s);
+        auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+        ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, nullptr, nullptr));
+        EXPECT_LT(corner_error(region, H), 0.05);
+        if (maximum == 0.0) {
+            EXPECT_EQ(region->status, TRACK_REGION_OK);
+            EXPECT_GT(region->rejected_fraction, 0.05);
+            EXPECT_LT(region->rejected_fraction, 0.3);
+            EXPECT_LT(plx_image_bit_count(region->observation_mask), uint32_t(kBox * kBox * 0.95));
+        } else {
+            EXPECT_EQ(region->status, TRACK_REGION_LOST);
+            EXPECT_EQ(region->rejected_fraction, DBL_MAX);
+        }
+    }
+}
+
+TEST(TrackHomogMatch, SameResultWithOneAndFourJobs)
+{
+    const double c = kBox0 + kBox / 2.0;
+    const Plx_Matrix33 H = about_centre(mat33({1.02, 0.015, 0, -0.01, 0.985, 0, 0, 0, 1}), c, c, 1.2, 0.6);
+    Plx_Matrix33 result[2];
+    double rms[2];
+    const uint32_t jobs[2] = {1, 4};
+    for (int k = 0; k < 2; ++k) {
+        HostPtr host(plano_host_new(jobs[k]));
+        Frames f(H);
+        TrackPtr track = make_track(f, Settings{}, plano_host_interface(host.get()));
+        auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+        ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, plano_host_interface(host.get()), nullptr));
+        result[k] = region->homography;
+        rms[k] = region->rms_residual;
+    }
+    for (int i = 0; i < 9; ++i) EXPECT_NEAR(result[0].m[i / 3][i % 3], result[1].m[i / 3][i % 3], 1e-9);
+    EXPECT_NEAR(rms[0], rms[1], 1e-9 * rms[0]);
+}
+
+TEST(TrackHomogMatch, InterruptKeepsTheLevelsStartingMotion)
+{
+    HostPtr host(plano_host_new(2));
+    plano_host_request_interrupt(host.get(), 1);
+    Frames f(mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1}));
+    TrackPtr track = make_track(f, Settings{}, plano_host_interface(host.get()));
+    auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+    const Plx_Matrix33 before = region->homography;
+    StatusTime st{100.0, 0.0};
+    ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, plano_host_interface(host.get()), &st));
+    for (int i = 0; i < 9; ++i) EXPECT_EQ(region->homography.m[i / 3][i % 3], before.m[i / 3][i % 3]);
+    EXPECT_GT(st.done, 0.0);
+    EXPECT_EQ(region->observation_mask, nullptr);
+}
+
+// Two regions sharing a constraint point whose target is estimated: the estimate lands where
+// the true motion carries the point.
+TEST(TrackHomogMatch, EstimatesConstraintTarget)
+{
+    const Plx_Matrix33 H = mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1});
+    Frames f(H);
+    Settings s;
+    s.model = TRACK_MODEL_TRANSLATE;
+    TrackPtr track = make_track(f, s);
+    auto *a = static_cast<TrackRegion *>(track->regions->head->data);
+    const double ref[2] = {40.0, 50.0}, info[3] = {4.0, 0.0, 4.0};
+    TrackConstraintPoint *p = pTrackConstraintPointNRegions(track.get(), &a, 1, ref, info, nullptr, info);
+    ASSERT_NE(p, nullptr);
+    ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, nullptr, nullptr));
+    EXPECT_NEAR(p->target_point[0], 41.3, 0.05);
+    EXPECT_NEAR(p->target_point[1], 49.3, 0.05);
+    EXPECT_GT(p->target_information[0], 0.0);
+    EXPECT_EQ(p->target_state, nullptr);
+}
+
+TEST(TrackHomogMatch, FailuresAreReported)
+{
+    EXPECT_FALSE(bTrackHomogOptimise(nullptr, 1, 1e-3, 10.0, nullptr, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    Frames f(mat33({1, 0, 0, 0, 1, 0, 0, 0, 1}));
+    Settings s;
+    TrackPtr track = make_track(f, s);
+    auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+    // An affine region whose homography has left its shape.
+    region->homography.m[2][0] = 1e-3;
+    EXPECT_FALSE(bTrackHomogOptimise(track.get(), 1, 1e-3, 10.0, nullptr, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_INCOMPATIBLE);
+    region->homography.m[2][0] = 0.0;
+    region->settings.intensity_sigma = 0.0;
+    EXPECT_FALSE(bTrackHomogOptimise(track.get(), 1, 1e-3, 10.0, nullptr, nullptr));
+    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_EQ(region->state, nullptr);
+    // A track without regions has nothing to do.
+    TrackPtr empty(pTrackNew(f.previous.get(), &f.camera, f.current.get(), &f.camera, 2, nullptr));
+    EXPECT_TRUE(bTrackHomogOptimise(empty.get(), 1, 1e-3, 10.0, nullptr, nullptr));
+}
+
+}  // namespace
