@@ -1,7 +1,7 @@
 # Entry points of the README. Every target installs missing Debian packages first.
 BUILD ?= build
 JOBS ?= 2
-PACKAGES = cmake g++ make libeigen3-dev libgtest-dev libbenchmark-dev
+PACKAGES = cmake g++ make libeigen3-dev libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev libopenimageio-dev
 PEER_PACKAGES = libopencv-dev libceres-dev
 
 .PHONY: setup build test demo bench sanitize clean
@@ -17,9 +17,9 @@ build: setup
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j$(JOBS)
 
-# The main job: a small program on the C interface (the command-line tool comes later).
+# The main job: the command-line tool's demonstration (track a shot, insert an image onto it).
 demo: build
-	$(BUILD)/examples/corner_pin_demo
+	$(BUILD)/tools/plano demo
 
 bench: setup
 	@bash scripts/install-packages.sh $(PEER_PACKAGES)

@@ -8,7 +8,12 @@
 #include "plano/four_point.h"
 #include "plano/fixed_corner_camera.h"
 #include "plano/sumo.h"
+#include "plano/sumo_states.h"
 #include "plano/projective_warp.h"
 #include "plano/track.h"
+#include "plano/track_pixels.h"
+#include "plano/track_correlation.h"
+#include "plano/track_homography.h"
+#include "plano/matchmove.h"
 
 #endif

@@ -1,0 +1,37 @@
+// Plates of a tracked sequence for the rendering commands.
+#include "plates.hpp"
+
+#include <climits>
+#include <filesystem>
+
+#include "sequence.hpp"
+
+namespace plano_tool {
+
+// The frames of a result to render: all of them, or those in the given range.
+std::vector<const FrameResult *> frames_to_render(const TrackResult &result, const std::string &range_text)
+{
+    FrameRange range{INT32_MIN, INT32_MAX};
+    if (!range_text.empty()) range = parse_frame_range(range_text);
+    std::vector<const FrameResult *> out;
+    for (const FrameResult &f : result.frames)
+        if (f.frame >= range.first && f.frame <= range.last) out.push_back(&f);
+    if (out.empty()) throw ToolError("no tracked frames to render");
+    return out;
+}
+
+// Checks the plate against the track and that the output will not overwrite it.
+void check_plate(const Plx_Image &plate, const TrackResult &track, const std::string &plate_path,
+                 const std::string &out_path)
+{
+    if (plate.width != track.width || plate.height != track.height)
+        throw ToolError("'" + plate_path + "' is " + std::to_string(plate.width) + "x" +
+                        std::to_string(plate.height) + " but the track was made on " +
+                        std::to_string(track.width) + "x" + std::to_string(track.height) + " plates");
+    std::error_code ec1, ec2;
+    if (plate_path == out_path ||
+        std::filesystem::weakly_canonical(plate_path, ec1) == std::filesystem::weakly_canonical(out_path, ec2))
+        throw ToolError("output '" + out_path + "' would overwrite its plate");
+}
+
+}  // namespace plano_tool
