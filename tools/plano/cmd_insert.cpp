@@ -28,23 +28,15 @@ int run_insert(const InsertOptions &o)
     HostPtr host = make_host(o.threads);
     ProgressBar progress("insert", static_cast<int>(frames.size()), !o.quiet);
     int untracked = 0;
-    for (const FrameResult *f : frames) {
-        if (interrupted()) throw ToolError("interrupted; " + std::to_string(progress.done()) + " frames written",
-                                           kExitInterrupted);
-        std::string plate_path = plates.path(f->frame), out_path = output.path(f->frame);
-        ImagePtr plate = read_image(plate_path);
-        check_plate(*plate, track, plate_path, out_path);
-        if (f->status == TRACK_REGION_OK) {
-            ImagePtr frame = insert_onto(*plate, *insert, f->corners, o.feather, plano_host_interface(host.get()));
-            write_image(out_path, *frame);
-        } else {
-            // An untracked frame keeps its plate, so the output sequence has no holes.
-            write_image(out_path, *plate);
-            ++untracked;
-        }
-        progress.frame_done();
-    }
-    double fps = progress.finish();
+    const double fps = render_frames(track, plates, output, frames, progress,
+                                     [&](const Plx_Image &plate, const FrameResult &f) -> ImagePtr {
+                                         if (f.status == TRACK_REGION_OK)
+                                             return insert_onto(plate, *insert, f.corners, o.feather,
+                                                                plano_host_interface(host.get()));
+                                         // An untracked frame keeps its plate: the output has no holes.
+                                         ++untracked;
+                                         return nullptr;
+                                     });
     if (!o.quiet)
         std::fprintf(stderr, "plano insert: %zu frames written to %s (%.2f fps)%s\n", frames.size(),
                      output.text().c_str(), fps,

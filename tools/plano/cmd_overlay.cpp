@@ -41,17 +41,11 @@ int run_overlay(const OverlayOptions &o)
     if (!(o.thickness > 0 && o.thickness <= 100)) throw ToolError("thickness must be in (0, 100] pixels");
     HostPtr host = make_host(1);  // for Ctrl-C
     ProgressBar progress("overlay", static_cast<int>(frames.size()), !o.quiet);
-    for (const FrameResult *f : frames) {
-        if (interrupted()) throw ToolError("interrupted; " + std::to_string(progress.done()) + " frames written",
-                                           kExitInterrupted);
-        std::string plate_path = plates.path(f->frame), out_path = output.path(f->frame);
-        ImagePtr plate = read_image(plate_path);
-        check_plate(*plate, track, plate_path, out_path);
-        ImagePtr frame = overlay_quad(*plate, f->corners, f->status == TRACK_REGION_OK ? ok : lost, o.thickness);
-        write_image(out_path, *frame);
-        progress.frame_done();
-    }
-    double fps = progress.finish();
+    const double fps = render_frames(track, plates, output, frames, progress,
+                                     [&](const Plx_Image &plate, const FrameResult &f) {
+                                         return overlay_quad(plate, f.corners, f.status == TRACK_REGION_OK ? ok : lost,
+                                                             o.thickness);
+                                     });
     if (!o.quiet)
         std::fprintf(stderr, "plano overlay: %zu frames written to %s (%.2f fps)\n", frames.size(),
                      output.text().c_str(), fps);

@@ -5,6 +5,7 @@
 #include <filesystem>
 
 #include "sequence.hpp"
+#include "tool.hpp"
 
 namespace plano_tool {
 
@@ -32,6 +33,23 @@ void check_plate(const Plx_Image &plate, const TrackResult &track, const std::st
     if (plate_path == out_path ||
         std::filesystem::weakly_canonical(plate_path, ec1) == std::filesystem::weakly_canonical(out_path, ec2))
         throw ToolError("output '" + out_path + "' would overwrite its plate");
+}
+
+double render_frames(const TrackResult &track, const FramePattern &plates, const FramePattern &output,
+                     const std::vector<const FrameResult *> &frames, ProgressBar &progress,
+                     const std::function<ImagePtr(const Plx_Image &plate, const FrameResult &frame)> &render)
+{
+    for (const FrameResult *f : frames) {
+        if (interrupted())
+            throw ToolError("interrupted; " + std::to_string(progress.done()) + " frames written", kExitInterrupted);
+        std::string plate_path = plates.path(f->frame), out_path = output.path(f->frame);
+        ImagePtr plate = read_image(plate_path);
+        check_plate(*plate, track, plate_path, out_path);
+        ImagePtr frame = render(*plate, *f);
+        write_image(out_path, frame ? *frame : *plate);
+        progress.frame_done();
+    }
+    return progress.finish();
 }
 
 }  // namespace plano_tool

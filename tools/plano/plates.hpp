@@ -2,9 +2,12 @@
 #ifndef PLANO_TOOL_PLATES_HPP
 #define PLANO_TOOL_PLATES_HPP
 
+#include <functional>
 #include <string>
 #include <vector>
 
+#include "progress.hpp"
+#include "sequence.hpp"
 #include "track_io.hpp"
 
 namespace plano_tool {
@@ -14,6 +17,12 @@ std::vector<const FrameResult *> frames_to_render(const TrackResult &result, con
 // Refuses a plate of another size than the track's, and an output path that is the plate's.
 void check_plate(const Plx_Image &plate, const TrackResult &track, const std::string &plate_path,
                  const std::string &out_path);
+// Reads, checks and renders the plate of every frame into the output pattern, a frame at a
+// time, honouring Ctrl-C between frames; render returns null to write the plate as it is.
+// Returns the frames per second.
+double render_frames(const TrackResult &track, const FramePattern &plates, const FramePattern &output,
+                     const std::vector<const FrameResult *> &frames, ProgressBar &progress,
+                     const std::function<ImagePtr(const Plx_Image &plate, const FrameResult &frame)> &render);
 
 }  // namespace plano_tool
 
