@@ -11,6 +11,7 @@
 #include <string>
 
 #include "plano_host/host.h"
+#include "ratio_reporter.hpp"
 
 #ifdef PLANO_HAVE_OPENCV
 #pragma GCC diagnostic push
@@ -106,54 +107,12 @@ BENCHMARK(BM_Plano)->Apply(arguments);
 BENCHMARK(BM_OpenCV)->Apply(arguments);
 #endif
 
-// Keeps the medians of every case, keyed without the peer's name, and prints our time over
-// OpenCV's at the end: wall-clock, and CPU time of the calling thread (steadier on a shared
-// machine; with one job all work runs on the calling thread, on both sides).
-class RatioReporter : public benchmark::ConsoleReporter {
-public:
-    void ReportRuns(const std::vector<Run> &runs) override
-    {
-        ConsoleReporter::ReportRuns(runs);
-        for (const Run &r : runs) {
-            if (r.aggregate_name != "median") continue;
-            const std::string &l = r.report_label;
-            const std::size_t slash = l.find('/');
-            if (slash == std::string::npos) continue;
-            Times &t = (l.compare(0, slash, "plano") == 0 ? plano_ : opencv_)[l.substr(slash + 1)];
-            t.real = r.GetAdjustedRealTime();
-            t.cpu = r.GetAdjustedCPUTime();
-        }
-    }
-    void Finalize() override
-    {
-        ConsoleReporter::Finalize();
-        std::printf("\n%-26s %9s %9s %7s %9s %9s %7s\n", "median ms", "plano", "opencv", "ratio", "plano cpu",
-                    "opencv", "ratio");
-        for (const auto &[name, t] : plano_) {
-            const auto peer = opencv_.find(name);
-            if (peer == opencv_.end()) {
-                std::printf("%-26s %9.2f %9s %7s %9.2f\n", name.c_str(), t.real, "-", "-", t.cpu);
-                continue;
-            }
-            const Times &o = peer->second;
-            std::printf("%-26s %9.2f %9.2f %7.2f %9.2f %9.2f %7.2f\n", name.c_str(), t.real, o.real, t.real / o.real,
-                        t.cpu, o.cpu, t.cpu / o.cpu);
-        }
-    }
-
-private:
-    struct Times {
-        double real = 0, cpu = 0;
-    };
-    std::map<std::string, Times> plano_, opencv_;
-};
-
 }  // namespace
 
 int main(int argc, char **argv)
 {
     benchmark::Initialize(&argc, argv);
-    RatioReporter reporter;
+    RatioReporter reporter("opencv", 26, 2);
     benchmark::RunSpecifiedBenchmarks(&reporter);
     vThreadedWorkerPoolFree();
     benchmark::Shutdown();

@@ -28,6 +28,7 @@
 #include <vector>
 
 #include "plano_host/host.h"
+#include "ratio_reporter.hpp"
 
 #ifdef PLANO_HAVE_CERES
 #pragma GCC diagnostic push
@@ -624,54 +625,12 @@ BENCHMARK(BM_Sumo)->Apply(arguments);
 BENCHMARK(BM_Ceres)->Apply(arguments);
 #endif
 
-// Keeps the median of every case, keyed without the peer's name, and prints our time over
-// Ceres' at the end: wall clock, and CPU time of the calling thread (steadier on a shared
-// machine; with one job all the work runs on the calling thread, on both sides).
-class RatioReporter : public benchmark::ConsoleReporter {
-public:
-    void ReportRuns(const std::vector<Run> &runs) override
-    {
-        ConsoleReporter::ReportRuns(runs);
-        for (const Run &r : runs) {
-            if (r.aggregate_name != "median") continue;
-            const std::string &l = r.report_label;
-            const std::size_t slash = l.find('/');
-            if (slash == std::string::npos) continue;
-            Times &t = (l.compare(0, slash, "plano") == 0 ? plano_ : ceres_)[l.substr(slash + 1)];
-            t.real = r.GetAdjustedRealTime();
-            t.cpu = r.GetAdjustedCPUTime();
-        }
-    }
-    void Finalize() override
-    {
-        ConsoleReporter::Finalize();
-        std::printf("\n%-16s %9s %9s %7s %9s %9s %7s\n", "median ms", "plano", "ceres", "ratio", "plano cpu", "ceres",
-                    "ratio");
-        for (const auto &[name, t] : plano_) {
-            const auto peer = ceres_.find(name);
-            if (peer == ceres_.end()) {
-                std::printf("%-16s %9.3f %9s %7s %9.3f\n", name.c_str(), t.real, "-", "-", t.cpu);
-                continue;
-            }
-            const Times &c = peer->second;
-            std::printf("%-16s %9.3f %9.3f %7.2f %9.3f %9.3f %7.2f\n", name.c_str(), t.real, c.real, t.real / c.real,
-                        t.cpu, c.cpu, t.cpu / c.cpu);
-        }
-    }
-
-private:
-    struct Times {
-        double real = 0, cpu = 0;
-    };
-    std::map<std::string, Times> plano_, ceres_;
-};
-
 }  // namespace
 
 int main(int argc, char **argv)
 {
     benchmark::Initialize(&argc, argv);
-    RatioReporter reporter;
+    RatioReporter reporter("ceres", 16, 3);
     benchmark::RunSpecifiedBenchmarks(&reporter);
     vThreadedWorkerPoolFree();
     benchmark::Shutdown();
