@@ -115,21 +115,7 @@ Image correlate(const ThreadHostInterface *host, const Plx_Image *t, const Plx_I
     return Image(pgiTrackImageCorrelate2D_q(host, t, weight, s, smask, texture, nullptr, nullptr, 0));
 }
 
-class TrackCorrelation : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        vThreadedWorkerPoolFree();
-        host_ = plano_host_new(3);
-    }
-    void TearDown() override
-    {
-        vThreadedWorkerPoolFree();
-        plano_host_free(host_);
-    }
-    const ThreadHostInterface *table() const { return plano_host_interface(host_); }
-    PlanoHost *host_ = nullptr;
-};
+class TrackCorrelation : public HostTest {};
 
 TEST_F(TrackCorrelation, TemplateCutFromTheSearchImagePeaksWhereItWasCut)
 {

@@ -138,21 +138,7 @@ std::vector<double> smooth_by_hand(const std::vector<double> &in, int32_t h, int
     return out;
 }
 
-class TrackSmooth : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        vThreadedWorkerPoolFree();
-        host_ = plano_host_new(3);
-    }
-    void TearDown() override
-    {
-        vThreadedWorkerPoolFree();
-        plano_host_free(host_);
-    }
-    const ThreadHostInterface *table() const { return plano_host_interface(host_); }
-    PlanoHost *host_ = nullptr;
-};
+class TrackSmooth : public HostTest {};
 
 TEST_F(TrackSmooth, PassesFollowTheMaskedRules)
 {

@@ -1,5 +1,5 @@
-// Image helpers shared by the tracking tests: owned images filled from a function, bit masks,
-// pixel reads and the code at the origin of the error trace.
+// Helpers shared by the tracking tests: owned images filled from a function, bit masks, pixel
+// reads, the code at the origin of the error trace, and a fixture with a host.
 #ifndef PLANO_TESTS_TRACK_TRACK_TEST_UTIL_HPP
 #define PLANO_TESTS_TRACK_TRACK_TEST_UTIL_HPP
 
@@ -7,7 +7,11 @@
 #include <memory>
 #include <vector>
 
+#include <gtest/gtest.h>
+
 #include "pellux/pellux.h"
+#include "plano/threads.h"
+#include "plano_host/host.h"
 
 namespace track_test {
 
@@ -48,6 +52,23 @@ inline int32_t origin_code()
     plx_err_get_error(0, &r);
     return r.code;
 }
+
+// A fixture with a three-job host and a fresh worker pool around every test.
+class HostTest : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        vThreadedWorkerPoolFree();
+        host_ = plano_host_new(3);
+    }
+    void TearDown() override
+    {
+        vThreadedWorkerPoolFree();
+        plano_host_free(host_);
+    }
+    const ThreadHostInterface *table() const { return plano_host_interface(host_); }
+    PlanoHost *host_ = nullptr;
+};
 
 }  // namespace track_test
 
