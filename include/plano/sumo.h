@@ -243,9 +243,10 @@ struct Sumo {
     Plx_Bool (*io_header_read)(void *file, uint32_t binary, void *arg);
     Plx_Bool (*io_header_write)(void *file, uint32_t binary, void *arg);
     void *io_header_arg;
-    /* Private: per-job workspaces kept between builds. */
+    /* Private: per-job workspaces kept between builds, and the last whole-model build. */
     SumoWorkspace *job_workspaces;
     uint32_t n_job_workspaces;
+    void *build_cache;
 };
 
 /* ---- optimiser ---- */

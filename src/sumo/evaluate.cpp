@@ -4,11 +4,21 @@
 #include <cfloat>
 #include <cmath>
 
+#include "sumo/fused_kernels.hpp"
 #include "sumo/sumo_internal.hpp"
 
 using namespace sumo;
 
 namespace {
+
+struct FusedPair {
+    SumoHFunction h;
+    FusedHKernel kernel;
+};
+constexpr uint32_t kMaxFused = 32;
+// Written only while the library loads; read without locks afterwards.
+FusedPair g_fused[kMaxFused];
+uint32_t g_no_fused = 0;
 
 bool is_h(const SumoObs *o) { return o->kind == SUMO_OBS_H || o->kind == SUMO_OBS_H_ROBUST; }
 bool is_robust(const SumoObs *o) { return o->kind == SUMO_OBS_H_ROBUST || o->kind == SUMO_OBS_F_ROBUST; }
@@ -129,9 +139,147 @@ double quad(const double *N, const double *r, uint32_t k)
     return q;
 }
 
+// Where an observation's information about state s goes: the fixed A and b when eliminating,
+// a thread's accumulators inside a threaded build, else the work copies.
+void info_target(SumoStateVector *s, uint32_t eliminate, uint32_t thread, double **A, double **b)
+{
+    if (eliminate) {
+        *A = s->A.data;
+        *b = s->b.data;
+    } else if (thread != SUMO_NOT_IN_THREAD) {
+        *A = s->thread_blocks[thread].A.data;
+        *b = s->thread_blocks[thread].b.data;
+    } else {
+        *A = s->A_work.data;
+        *b = s->b_work.data;
+    }
+}
+
+// The same for the block between s and t (*s_row: s is the block's row state).
+bool offdiag_target(Sumo *sumo, SumoStateVector *s, SumoStateVector *t, uint32_t eliminate, uint32_t thread,
+                    double **M, bool *s_row)
+{
+    SumoOffdiag *blk;
+    if (!block_between(sumo, s, t, thread == SUMO_NOT_IN_THREAD, &blk, s_row)) return false;
+    if (blk == nullptr) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_NOT_INITIALISED,
+                         "off-diagonal block not made before a threaded build", 0);
+        return false;
+    }
+    *M = eliminate ? blk->M.data : (thread != SUMO_NOT_IN_THREAD ? blk->thread_blocks[thread].data : blk->M_work.data);
+    return true;
+}
+
+// The cost of an evaluated observation from its chi-squared and decision.
+double cost_of(const SumoObs *o, double chi2)
+{
+    if (!is_robust(o) || !o->outlier) return chi2 * o->weight;
+    return (chi2 / o->variance_scaling + o->chi2_offset) * o->weight;
+}
+
+// The kernel to use for o, or null for the general path.
+FusedHKernel fused_kernel_of(const SumoObs *o)
+{
+    if (!is_h(o) || o->numeric_jacobians || !diagonal_type(o->N.type)) return nullptr;
+    return fused_h(o->func.h);
+}
+
+// Chi-squared (and the terms, when asked) from a fused kernel; sizes as the general path
+// checks them.
+FusedResult fused_chi2(FusedHKernel kernel, SumoObs *o, double *chi2, double *jtnj, double *jtnr)
+{
+    const uint32_t step = o->N.type == PLX_SQUMAT_DIAGONAL ? 1u : 0u;
+    if (step == 1 && o->N.size != o->z.v.rows) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_INCOMPATIBLE, "information matrix size", o->N.size);
+        return FusedResult::failed;
+    }
+    const FusedResult r = kernel(o->states, o->n_states, &o->z, o->N.data, step, chi2, jtnj, jtnr);
+    if (r == FusedResult::failed)
+        plx_err_register_fileline("bSumoObsEvaluate", PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
+    return r;
+}
+
+// accumulate_obs through a fused kernel: the same decisions, costs and destinations as the
+// general path, with the terms taken from the kernel's stacked J^T N J and J^T N r.
+FusedResult accumulate_fused(Sumo *sumo, FusedHKernel kernel, SumoObs *obs, uint32_t residual, uint32_t eliminate,
+                             uint32_t add, uint32_t first, uint32_t last, uint32_t thread, double *cost)
+{
+    constexpr FusedResult failed = FusedResult::failed;
+    uint32_t offset[8], n_total = 0;
+    bool want[8];
+    bool any = false;
+    if (obs->n_states > 8) return FusedResult::declined;
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        SumoStateVector *s = obs->states[i];
+        offset[i] = n_total;
+        n_total += s != nullptr ? dim(s) : 0;
+        want[i] = s != nullptr && is_active(s) && dim(s) > 0 && (first == kAll || (s->index >= first && s->index <= last));
+        any = any || want[i];
+    }
+    if (n_total > kFusedMaxParams) return FusedResult::declined;
+    double jtnj[kFusedMaxParams * kFusedMaxParams], jtnr[kFusedMaxParams];
+    double chi2 = 0.0;
+    const FusedResult r = fused_chi2(kernel, obs, &chi2, any ? jtnj : nullptr, jtnr);
+    if (r != FusedResult::done) return r;
+    *cost = 0.0;
+    if (residual) {
+        if (!std::isfinite(chi2)) {
+            PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_OUTSIDE_RANGE, "residual is not finite", 0);
+            return failed;
+        }
+        if (is_robust(obs)) obs->outlier = chi2 > obs->chi2_cutoff ? 1u : 0u;
+        *cost = cost_of(obs, chi2);
+    }
+    if (!any) return FusedResult::done;
+    double alpha = (add ? 1.0 : -1.0) * obs->weight;
+    if (is_robust(obs) && obs->outlier) alpha *= 1.0 / obs->variance_scaling;
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        if (!want[i]) continue;
+        SumoStateVector *s = obs->states[i];
+        const uint32_t n = dim(s), oi = offset[i];
+        double *A, *b;
+        info_target(s, eliminate, thread, &A, &b);
+        for (uint32_t r = 0; r < n; ++r) {
+            const double *src = jtnj + std::size_t(oi + r) * n_total + oi;
+            double *dst = A + std::size_t(r) * n;
+            for (uint32_t c = 0; c < n; ++c) dst[c] += alpha * src[c];
+            if (residual) b[r] += alpha * jtnr[oi + r];
+        }
+        for (uint32_t j = i + 1; j < obs->n_states; ++j) {
+            if (!want[j]) continue;
+            double *M;
+            bool i_row;
+            if (!offdiag_target(sumo, s, obs->states[j], eliminate, thread, &M, &i_row)) return failed;
+            // The row state's rows of the stacked matrix, the column state's columns.
+            const uint32_t row = i_row ? oi : offset[j], col = i_row ? offset[j] : oi;
+            const uint32_t rows = i_row ? n : dim(obs->states[j]), cols = i_row ? dim(obs->states[j]) : n;
+            for (uint32_t r = 0; r < rows; ++r) {
+                const double *src = jtnj + std::size_t(row + r) * n_total + col;
+                double *dst = M + std::size_t(r) * cols;
+                for (uint32_t c = 0; c < cols; ++c) dst[c] += alpha * src[c];
+            }
+        }
+    }
+    return FusedResult::done;
+}
+
 }  // namespace
 
 namespace sumo {
+
+bool register_fused_h(SumoHFunction h, FusedHKernel kernel)
+{
+    if (h == nullptr || kernel == nullptr || g_no_fused == kMaxFused) return false;
+    g_fused[g_no_fused++] = FusedPair{h, kernel};
+    return true;
+}
+
+FusedHKernel fused_h(SumoHFunction h)
+{
+    for (uint32_t i = 0; i < g_no_fused; ++i)
+        if (g_fused[i].h == h) return g_fused[i].kernel;
+    return nullptr;
+}
 
 // Evaluates the observation into the workspace: jacobian_ptrs (null when unwanted), h,
 // residual (when asked), N_eff and chi-squared. With `decide`, robust kinds take a new
@@ -205,17 +353,18 @@ bool evaluate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, bool residual, bool
     return true;
 }
 
-// The cost of an evaluated observation from its chi-squared and decision.
-double cost_of(const SumoObs *o, double chi2)
-{
-    if (!is_robust(o) || !o->outlier) return chi2 * o->weight;
-    return (chi2 / o->variance_scaling + o->chi2_offset) * o->weight;
-}
-
 double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, const char *function)
 {
     double chi2;
-    if (!evaluate_obs(sumo, ws, o, true, false, false, kAll, kAll, &chi2)) {
+    const FusedHKernel kernel = fused_kernel_of(o);
+    FusedResult r = kernel != nullptr ? fused_chi2(kernel, o, &chi2, nullptr, nullptr) : FusedResult::declined;
+    if (r == FusedResult::done && !std::isfinite(chi2)) {
+        PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_OUTSIDE_RANGE, "residual is not finite", 0);
+        r = FusedResult::failed;
+    }
+    if (r == FusedResult::declined)
+        r = evaluate_obs(sumo, ws, o, true, false, false, kAll, kAll, &chi2) ? FusedResult::done : FusedResult::failed;
+    if (r == FusedResult::failed) {
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return SUMO_FAILED_RESIDUAL;
     }
@@ -227,6 +376,11 @@ double obs_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *o, const char *function)
 bool accumulate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *obs, uint32_t residual, uint32_t eliminate, uint32_t add,
                     uint32_t first, uint32_t last, uint32_t thread, double *cost)
 {
+    if (obs->kind <= SUMO_OBS_F_ROBUST)
+        if (const FusedHKernel kernel = fused_kernel_of(obs)) {
+            const FusedResult r = accumulate_fused(sumo, kernel, obs, residual, eliminate, add, first, last, thread, cost);
+            if (r != FusedResult::declined) return r == FusedResult::done;
+        }
     double chi2;
     if (!evaluate_obs(sumo, ws, obs, residual != 0, residual != 0, true, first, last, &chi2)) return false;
     *cost = residual ? cost_of(obs, chi2) : 0.0;
@@ -256,31 +410,15 @@ bool accumulate_obs(Sumo *sumo, SumoWorkspace *ws, SumoObs *obs, uint32_t residu
         SumoStateVector *s = obs->states[i];
         const uint32_t n = Ji->cols;
         double *A, *b;
-        if (eliminate) {
-            A = s->A.data;
-            b = s->b.data;
-        } else if (thread != SUMO_NOT_IN_THREAD) {
-            A = s->thread_blocks[thread].A.data;
-            b = s->thread_blocks[thread].b.data;
-        } else {
-            A = s->A_work.data;
-            b = s->b_work.data;
-        }
+        info_target(s, eliminate, thread, &A, &b);
         add_atb_sym(alpha, Ji->data, ws->nj[i].data, k, n, A);
         if (residual) add_atv(alpha, ws->nj[i].data, ws->residual.data, k, n, b);
         for (uint32_t j = i + 1; j < obs->n_states; ++j) {
             const Plx_Matrix *Jj = ws->jacobian_ptrs[j];
             if (Jj == nullptr) continue;
-            SumoOffdiag *blk;
+            double *M;
             bool i_row;
-            if (!block_between(sumo, s, obs->states[j], thread == SUMO_NOT_IN_THREAD, &blk, &i_row)) return false;
-            if (blk == nullptr) {
-                PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_NOT_INITIALISED,
-                                 "off-diagonal block not made before a threaded build", 0);
-                return false;
-            }
-            double *M = eliminate ? blk->M.data
-                                  : (thread != SUMO_NOT_IN_THREAD ? blk->thread_blocks[thread].data : blk->M_work.data);
+            if (!offdiag_target(sumo, s, obs->states[j], eliminate, thread, &M, &i_row)) return false;
             if (i_row)
                 add_atb_block(alpha, Ji->data, ws->nj[j].data, k, n, Jj->cols, M);
             else

@@ -51,10 +51,19 @@ PLANO_API Plx_Bool bSumoLevMarqIterationBranchGen(Sumo *sumo, SumoBranch *branch
         sumo->cache_branch = branch;
         sumo->cache_first = sumo->cache_last = nullptr;
     }
+    // After a rejected step the root branch's build would repeat the previous one.
+    const bool reusable = accepted != nullptr && apply && branch == sumo->root;
     double c0 = 0.0;
-    if (!build_scope(sumo, scope, apply, first, last, host, __func__, cost_from_build ? &c0 : nullptr)) {
-        PLX_ERR_PASS();
-        return PLX_FALSE;
+    if (!(reusable && !stale && build_cache_restore(sumo, first, last))) {
+        if (!build_scope(sumo, scope, apply, first, last, host, __func__, cost_from_build ? &c0 : nullptr)) {
+            build_cache_drop(sumo);
+            PLX_ERR_PASS();
+            return PLX_FALSE;
+        }
+        if (reusable)
+            build_cache_take(sumo, first, last);
+        else
+            build_cache_drop(sumo);
     }
     if (cost_from_build) {
         sumo->residual = c0;
@@ -132,6 +141,7 @@ PLANO_API Plx_Bool bSumoLevMarqIterationStateRange(Sumo *sumo, SumoStateVector *
     if (reduction != nullptr) *reduction = 0.0;
     Scope scope;
     if (!open_run(sumo, first_state, last_state, true, __func__, &scope)) return PLX_FALSE;
+    build_cache_drop(sumo);
     if (!build_scope(sumo, scope, 1, first, last, host, __func__)) {
         PLX_ERR_PASS();
         return PLX_FALSE;

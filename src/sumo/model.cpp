@@ -140,6 +140,7 @@ PLANO_API void vSumoFree(Sumo *sumo, const ThreadHostInterface *host)
     vSumoObsListFree(sumo->obs_eliminated);
     sumo->obs_active = sumo->obs_eliminated = nullptr;
     free_job_workspaces(sumo);
+    build_cache_drop(sumo);
     if (sumo->owned) std::free(sumo);
 }
 

@@ -188,6 +188,7 @@ PLANO_API Plx_Bool bSumoRelaxationFinishBranch(Sumo *sumo, SumoBranch *branch, c
     sumo->cache_branch = branch;
     sumo->cache_first = sumo->cache_last = nullptr;
     sumo->modified = 0;
+    build_cache_drop(sumo);
     return PLX_TRUE;
 }
 

@@ -234,6 +234,14 @@ SumoWorkspace *job_workspaces(Sumo *sumo, uint32_t n);
 inline SumoWorkspace *job_ws(SumoWorkspace *base, uint32_t j) { return base + std::size_t(j) * kWorkspaceStride; }
 void free_job_workspaces(Sumo *sumo);
 
+// The last build of the root branch (see build_cache.cpp): taken after a build with index
+// limits first..last, restored in place of the next one with the same limits when nothing it
+// depends on changed (false: build as usual), dropped when something may have changed that
+// its key does not show.
+void build_cache_take(Sumo *sumo, uint32_t first, uint32_t last);
+bool build_cache_restore(Sumo *sumo, uint32_t first, uint32_t last);
+void build_cache_drop(Sumo *sumo);
+
 // ---- solver internals shared between files ----
 
 // Threaded passes give every job at least this much work (observations, or states for the

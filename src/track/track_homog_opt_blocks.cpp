@@ -76,6 +76,20 @@ struct Reference {
     }
 };
 
+// True when every pixel of a bit image is set. A search mask is mostly full (the window lies
+// inside the frame); the pixel-match functions then need not test it pixel by pixel.
+bool all_set(const Plx_Image *mask)
+{
+    const int32_t words = mask->width / 32, rest = mask->width % 32;
+    for (int32_t r = 0; r < mask->height; ++r) {
+        const auto *row = static_cast<const uint32_t *>(plx_image_row(mask, r));
+        for (int32_t w = 0; w < words; ++w)
+            if (row[w] != ~0u) return false;
+        if (rest != 0 && (row[words] & ((1u << rest) - 1u)) != (1u << rest) - 1u) return false;
+    }
+    return true;
+}
+
 bool on_pattern(uint32_t sampling, uint32_t grid, int32_t r, int32_t c)
 {
     if (sampling <= 1) return true;
@@ -167,6 +181,7 @@ PLANO_API Plx_Bool gbBuildPixelObservations(void *argument)
     double info = 1.0 / (job->intensity_sigma * job->intensity_sigma);
     const bool robust = job->robust_scale != 0.0;
     const double scaling = job->robust_scale * job->robust_scale;
+    const Plx_Image *search_mask = job->search_mask != nullptr && !all_set(job->search_mask) ? job->search_mask : nullptr;
     float *next_pos = positions;
 
     for (uint32_t j = 0; j < down; ++j) {
@@ -208,7 +223,7 @@ PLANO_API Plx_Bool gbBuildPixelObservations(void *argument)
             b.zh = job->zh;
             b.zh_f = float(job->zh);
             b.search_image = job->search;
-            b.search_mask = job->search_mask;
+            b.search_mask = search_mask;
             b.positions = block_pos;
             b.no_pixels = n;
             o->z.user_data = &b;

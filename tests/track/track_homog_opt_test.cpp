@@ -3,17 +3,22 @@
 // block building; and whole levels on synthetic frames related by known homographies.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cfloat>
 #include <cmath>
+#include <cstring>
+#include <random>
 #include <functional>
 #include <memory>
 #include <numbers>
+#include <string>
 #include <vector>
 
 #include "plano/sumo_states.h"
 #include "plano/track.h"
 #include "plano/track_homography.h"
 #include "plano_host/host.h"
+#include "track/pixel_match_lanes.hpp"
 
 namespace {
 
@@ -233,6 +238,161 @@ TEST(TrackHomogPixelMatch, PixelsLeavingTheWindowOrMaskContributeNothing)
             }
         plx_mat_free(&J0), plx_mat_free(&J1), plx_vec_free(&h);
     }
+}
+
+// The optimiser takes pixel blocks through a fused kernel that never writes the Jacobians
+// out: its information blocks, vectors and cost must be those of the h function's own
+// prediction and Jacobians (up to the single-precision sums), with dropped pixels, with and
+// without the illumination state, for a scaled identity and a diagonal information.
+TEST(TrackHomogPixelMatch, OptimiserBuildsBlocksAsTheirJacobiansSay)
+{
+    for (const PixelFunction &pf : pixel_functions())
+        for (uint32_t n_states : {1u, 2u})
+            for (bool diagonal : {false, true}) {
+                SCOPED_TRACE(std::string(pf.name) + (n_states == 2 ? " with gain" : "") + (diagonal ? " diagonal" : ""));
+                PixelCase pc(pf.format, pf.params, pf.type, 2.0);
+                pc.positions[0] = 15.6f;  // outside the search image
+                pc.mask = plx_image_form_gen_b(nullptr, 16, 16);
+                const double one = 1.0;
+                plx_image_fill_const(pc.mask, &one);
+                plx_image_set_bit(pc.mask, 3, 4, 0);  // drops pixel 2
+                pc.block.search_mask = pc.mask;
+                SumoVector z = pc.zvec();
+                const uint32_t m = z.v.rows, n = pc.states[0]->x.v.rows;
+                std::vector<double> info(m, 1.0 / (0.02 * 0.02));
+                if (diagonal)
+                    for (uint32_t r = 0; r < m; ++r) info[r] *= 0.5 + 0.1 * (r % 7);
+                Plx_SquMatrix N;
+                plx_squmat_form_data(&N, diagonal ? PLX_SQUMAT_DIAGONAL : PLX_SQUMAT_SCALED_IDENTITY, m, info.data());
+                SumoObs *o = pSumoObsH(pc.sumo.get(), &z.v, &N, pf.f, nullptr, pc.states, n_states);
+                ASSERT_NE(o, nullptr);
+                o->z.user_data = &pc.block;
+                ASSERT_TRUE(bSumoBuildInformationBlocksBranch(pc.sumo.get(), pc.sumo->root, 1, 0xFFFFFFFFu,
+                                                              0xFFFFFFFFu, nullptr));
+
+                // The reference from the h function, in double.
+                Plx_Matrix Jh{}, Ji{};
+                plx_mat_form(&Jh, m, n);
+                plx_mat_form(&Ji, m, 2);
+                Plx_Matrix *J[2] = {&Jh, &Ji};
+                Plx_Vector h{};
+                plx_vec_form(&h, m);
+                ASSERT_TRUE(pf.f(nullptr, nullptr, pc.states, n_states, &z, &h, J));
+                const uint32_t P = n + (n_states == 2 ? 2 : 0);
+                std::vector<double> H(P * P, 0.0), g(P, 0.0);
+                double chi2 = 0.0;
+                for (uint32_t r = 0; r < m; ++r) {
+                    std::vector<double> j(Jh.data + r * n, Jh.data + (r + 1) * n);
+                    if (n_states == 2) j.insert(j.end(), Ji.data + 2 * r, Ji.data + 2 * r + 2);
+                    const double w = info[diagonal ? r : 0], res = z.v.data[r] - h.data[r];
+                    chi2 += w * res * res;
+                    for (uint32_t a = 0; a < P; ++a) {
+                        g[a] += w * j[a] * res;
+                        for (uint32_t b = 0; b < P; ++b) H[a * P + b] += w * j[a] * j[b];
+                    }
+                }
+                double scale = 0.0, gscale = 0.0;
+                for (double v : H) scale = std::max(scale, std::fabs(v));
+                for (double v : g) gscale = std::max(gscale, std::fabs(v));
+                auto expect_block = [&](const double *got, uint32_t r0, uint32_t c0, uint32_t rows, uint32_t cols) {
+                    for (uint32_t a = 0; a < rows; ++a)
+                        for (uint32_t b = 0; b < cols; ++b)
+                            EXPECT_NEAR(got[a * cols + b], H[(r0 + a) * P + c0 + b], 1e-5 * scale) << a << "," << b;
+                };
+                expect_block(pc.states[0]->A_work.data, 0, 0, n, n);
+                for (uint32_t a = 0; a < n; ++a) EXPECT_NEAR(pc.states[0]->b_work.data[a], g[a], 1e-5 * gscale);
+                if (n_states == 2) {
+                    expect_block(pc.states[1]->A_work.data, n, n, 2, 2);
+                    for (uint32_t a = 0; a < 2; ++a) EXPECT_NEAR(pc.states[1]->b_work.data[a], g[n + a], 1e-5 * gscale);
+                    const SumoOffdiag *k = pc.states[0]->row_blocks ? pc.states[0]->row_blocks : pc.states[1]->row_blocks;
+                    ASSERT_NE(k, nullptr);
+                    if (k->row == pc.states[0])
+                        expect_block(k->M_work.data, 0, n, n, 2);
+                    else
+                        expect_block(k->M_work.data, n, 0, 2, n);
+                }
+                SumoWorkspace *ws = pSumoWorkspaceForm(nullptr);
+                EXPECT_NEAR(dSumoObsComputeResidual(pc.sumo.get(), ws, o), chi2, 1e-5 * chi2);
+                vSumoWorkspaceFree(ws);
+                plx_mat_free(&Jh), plx_mat_free(&Ji), plx_vec_free(&h);
+            }
+}
+
+// The fused kernel's portable and AVX2 lane packs must give the same bits, so that results
+// do not depend on the machine: blocks with partial groups, pixels outside the image and
+// under mask holes, every warp, grey and colour, with and without gain, both weightings.
+template <plano::pixel_match::Warp W, uint32_t C, bool Illum>
+void expect_same_lanes(const plano::pixel_match::BlockArgs &args)
+{
+    namespace pm = plano::pixel_match;
+    constexpr uint32_t P = pm::warp_params<W>() + (Illum ? 2 : 0);
+    double chi[2], jtnj[2][P * P], jtnr[2][P];
+    pm::portable::fused_block<W, C, Illum>(args, 0.25, &chi[0], jtnj[0], jtnr[0]);
+    pm::avx2::fused_block<W, C, Illum>(args, 0.25, &chi[1], jtnj[1], jtnr[1]);
+    EXPECT_EQ(std::memcmp(&chi[0], &chi[1], sizeof chi[0]), 0) << chi[0] << " " << chi[1];
+    if (!args.terms) return;
+    EXPECT_EQ(std::memcmp(jtnj[0], jtnj[1], sizeof jtnj[0]), 0);
+    EXPECT_EQ(std::memcmp(jtnr[0], jtnr[1], sizeof jtnr[0]), 0);
+    EXPECT_NE(jtnj[0][0], 0.0);
+}
+
+template <plano::pixel_match::Warp W, uint32_t C>
+void expect_same_lanes_with_and_without_gain(plano::pixel_match::BlockArgs args, std::initializer_list<float> p)
+{
+    std::copy(p.begin(), p.end(), args.p);
+    expect_same_lanes<W, C, true>(args);
+    expect_same_lanes<W, C, false>(args);
+}
+
+TEST(TrackHomogPixelMatch, PortableAndVectorKernelsGiveTheSameBits)
+{
+    namespace pm = plano::pixel_match;
+    if (!pm::avx2_available()) GTEST_SKIP() << "no AVX2 on this machine";
+    using W = pm::Warp;
+    std::mt19937 rng(5);
+    std::uniform_real_distribution<float> u(0.f, 1.f);
+    for (Plx_ImageFormat format : {PLX_FORMAT_GREY, PLX_FORMAT_RGBA})
+        for (uint32_t n_px : {5u, 61u})
+            for (int variant = 0; variant < 4; ++variant) {
+                SCOPED_TRACE(std::to_string(format) + " " + std::to_string(n_px) + " " + std::to_string(variant));
+                ImagePtr search = float_image(40, 48, format);
+                ImagePtr mask(plx_image_form_gen_b(nullptr, 40, 48));
+                const double one = 1.0;
+                plx_image_fill_const(mask.get(), &one);
+                for (int k = 0; k < 12; ++k) plx_image_set_bit(mask.get(), 10 + k, 5 + 3 * k, 0);
+                std::vector<float> pos;
+                for (uint32_t i = 0; i < n_px; ++i) pos.insert(pos.end(), {u(rng) * 52.f - 2.f, u(rng) * 44.f - 2.f});
+                std::vector<double> z(n_px * 4), info(n_px * 4);
+                for (std::size_t i = 0; i < z.size(); ++i) z[i] = u(rng), info[i] = 100.0 + 50.0 * u(rng);
+                pm::BlockArgs a{};
+                a.gain = 1.1f, a.offset = 0.05f, a.zh = 1.5f;
+                a.data = static_cast<const float *>(search->data);
+                a.stride = search->stride / 4;
+                a.step = int32_t(plx_image_format_channels(format));
+                a.wlim = 47.f, a.hlim = 39.f;
+                a.mask = variant & 1 ? mask.get() : nullptr;
+                a.positions = pos.data();
+                a.no_pixels = n_px;
+                a.z = z.data();
+                a.info = info.data();
+                a.info_step = variant & 2 ? 1 : 0;
+                for (bool terms : {true, false}) {
+                    a.terms = terms;
+                    if (format == PLX_FORMAT_GREY) {
+                        expect_same_lanes_with_and_without_gain<W::proj, 1>(
+                            a, {1.01f, 0.02f, 0.7f, -0.03f, 0.98f, 0.4f, 0.001f, -0.002f, 1.f});
+                        expect_same_lanes_with_and_without_gain<W::affine, 1>(a, {1.01f, 0.02f, 0.7f, -0.03f, 0.98f, 0.4f});
+                        expect_same_lanes_with_and_without_gain<W::translate, 1>(a, {0.7f, 0.4f});
+                        expect_same_lanes_with_and_without_gain<W::trans_rot_scale, 1>(a, {1.01f, 0.7f, 0.03f, 0.4f});
+                        expect_same_lanes_with_and_without_gain<W::trans_scale, 1>(a, {0.99f, 0.7f, 0.4f});
+                    } else {
+                        expect_same_lanes_with_and_without_gain<W::proj, 3>(
+                            a, {1.01f, 0.02f, 0.7f, -0.03f, 0.98f, 0.4f, 0.001f, -0.002f, 1.f});
+                        expect_same_lanes_with_and_without_gain<W::affine, 3>(a, {1.01f, 0.02f, 0.7f, -0.03f, 0.98f, 0.4f});
+                        expect_same_lanes_with_and_without_gain<W::translate, 3>(a, {0.7f, 0.4f});
+                    }
+                }
+            }
 }
 
 TEST(TrackHomogPixelMatch, RejectsBlocksThatDoNotFit)

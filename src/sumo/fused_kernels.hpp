@@ -1,0 +1,38 @@
+// Fused evaluation of h-type observations. An h function may be paired with a kernel that
+// predicts the observation and forms its normal-equation terms in the same pass, so that
+// observations with thousands of rows (image blocks) never write out their Jacobians. The
+// optimiser uses the kernel whenever the observation's information matrix is diagonal or a
+// scaled identity and its Jacobians are analytic; everything else (robust decisions, outlier
+// scaling, where the terms are added) stays the optimiser's.
+#ifndef PLANO_SRC_SUMO_FUSED_KERNELS_HPP
+#define PLANO_SRC_SUMO_FUSED_KERNELS_HPP
+
+#include <cstdint>
+
+#include "plano/sumo.h"
+
+namespace sumo {
+
+// Largest summed dimension of an observation's states that a kernel may be asked for.
+constexpr uint32_t kFusedMaxParams = 16;
+
+// Writes chi2 = r^T N r (r = z - h) and, when jtnj is not null, J^T N J (n x n, both
+// triangles, row-major) and J^T N r (n) into jtnj and jtnr, where J stacks the Jacobians of
+// the observation's states in order (n = sum of their dimensions, a null state counting 0).
+// N is diagonal with entry r at info[r * info_step] (step 0: a scaled identity). A kernel may
+// decline an observation it cannot take (the general path then evaluates it); a failure is
+// registered as the h function would register it.
+enum class FusedResult { done, failed, declined };
+using FusedHKernel = FusedResult (*)(SumoStateVector **states, uint32_t n_states, const SumoVector *z,
+                                     const double *info, uint32_t info_step, double *chi2, double *jtnj,
+                                     double *jtnr);
+
+// Pairs a kernel with an h function. Registration happens while the library loads (static
+// initialisers), before any optimiser runs; at most 32 pairs.
+bool register_fused_h(SumoHFunction h, FusedHKernel kernel);
+// The kernel paired with h, or null.
+FusedHKernel fused_h(SumoHFunction h);
+
+}  // namespace sumo
+
+#endif
