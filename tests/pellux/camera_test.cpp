@@ -3,6 +3,8 @@
 // their fields, and the failure codes.
 #include <gtest/gtest.h>
 
+#include "failure_check.hpp"
+
 #include <cmath>
 #include <cstring>
 #include <string>
@@ -12,11 +14,14 @@
 
 namespace {
 
+using plano_test::fails_with;
+
 int32_t origin_code()
 {
     Plx_ErrorRecord r;
     return plx_err_get_error(0, &r) ? r.code : 0;
 }
+
 
 struct Kind {
     const char *name;
@@ -256,8 +261,7 @@ TEST(Camera, LinesMapExactlyThroughLinearCamerasOnly)
         Plx_Vector3 a{0.1, 0.2, 1}, b{-0.3, 0.05, 1};
         Plx_Vector3 line{a.y * b.z - a.z * b.y, a.z * b.x - a.x * b.z, a.x * b.y - a.y * b.x}, image_line, back;
         if (k.type != PLX_LINEAR_CAMERA && k.type != PLX_AFFINE_CAMERA) {
-            EXPECT_FALSE(plx_camera_project_line(&c, &line, &image_line)) << k.name;
-            EXPECT_EQ(origin_code(), PLX_ERROR_UNSUPPORTED);
+            EXPECT_TRUE(fails_with(plx_camera_project_line(&c, &line, &image_line), PLX_ERROR_UNSUPPORTED)) << k.name;
             int32_t code = 0;
             EXPECT_FALSE(c.line_backproject(&c, &line, &back, &code));
             EXPECT_EQ(code, PLX_ERROR_UNSUPPORTED);
@@ -331,8 +335,7 @@ TEST(Camera, SolvesBeyondTheLensRangeFailWithCode27)
     // The cubic has a root near x = -1.8, beyond the fold of the lens: it must not be taken.
     EXPECT_EQ(code, PLX_ERROR_OUTSIDE_RANGE);
     EXPECT_EQ(out.x, 7);  // outputs untouched on failure
-    EXPECT_FALSE(plx_camera_remove_distortion(&c, &pixel, &out));
-    EXPECT_EQ(origin_code(), code);
+    EXPECT_TRUE(fails_with(plx_camera_remove_distortion(&c, &pixel, &out), code));
 }
 
 TEST(Camera, ErrorSlotOrTraceAndZeroDivisors)
@@ -364,27 +367,22 @@ TEST(Camera, ErrorSlotOrTraceAndZeroDivisors)
     EXPECT_EQ(r.code, PLX_ERROR_CALLEE);
     EXPECT_STREQ(r.function, "plx_camera_backproject_point");
 
-    EXPECT_FALSE(plx_camera_project_point(nullptr, &behind, &out));
-    EXPECT_EQ(origin_code(), PLX_ERROR_NOT_INITIALISED);
+    EXPECT_TRUE(fails_with(plx_camera_project_point(nullptr, &behind, &out), PLX_ERROR_NOT_INITIALISED));
     Plx_Camera empty{};
-    EXPECT_FALSE(plx_camera_add_distortion(&empty, &behind, &out));
-    EXPECT_EQ(origin_code(), PLX_ERROR_NOT_INITIALISED);
+    EXPECT_TRUE(fails_with(plx_camera_add_distortion(&empty, &behind, &out), PLX_ERROR_NOT_INITIALISED));
 }
 
 TEST(Camera, BuildersCheckTheirFieldsAndTypes)
 {
     Plx_Camera c = make(kinds()[0]);
     const Plx_Camera before = c;
-    EXPECT_FALSE(plx_camera_build_linear(&c, 1, 0, 100, 0, 0));
-    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
-    EXPECT_FALSE(plx_camera_build_radial_1(&c, 1, 100, 0, 0, 0, 0.1));
-    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_TRUE(fails_with(plx_camera_build_linear(&c, 1, 0, 100, 0, 0), PLX_ERROR_DIVISION_BY_ZERO));
+    EXPECT_TRUE(fails_with(plx_camera_build_radial_1(&c, 1, 100, 0, 0, 0, 0.1), PLX_ERROR_DIVISION_BY_ZERO));
     EXPECT_FALSE(plx_camera_build_xy_distortion(&c, 0, 100, 100, 0, 0, 0, 0, 0, 0));
     EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
     EXPECT_FALSE(plx_camera_build_radial_2(&c, 1, 100, 100, 0, 0, std::nan(""), 0));
     EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
-    EXPECT_FALSE(plx_camera_build_linear(nullptr, 1, 100, 100, 0, 0));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    EXPECT_TRUE(fails_with(plx_camera_build_linear(nullptr, 1, 100, 100, 0, 0), PLX_ERROR_ILLEGAL_ARGUMENT));
     for (int32_t type : {6, 7, 8, 10, 11, -1, 42}) {
         EXPECT_FALSE(plx_camera_build_va(&c, type, 1.0, 100.0, 100.0, 0.0, 0.0, 0.0, 0.0)) << type;
         EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_TYPE) << type;
@@ -443,25 +441,20 @@ TEST(Camera, InternalizeAndConversionRebuildTheOperations)
     Plx_Camera c = make(kinds()[0]);
     const Plx_Camera before = c;
     c.type = PLX_FIXED_CORNER_WARP_CAMERA;
-    EXPECT_FALSE(plx_camera_internalize(&c));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_TYPE);
+    EXPECT_TRUE(fails_with(plx_camera_internalize(&c), PLX_ERROR_ILLEGAL_TYPE));
     Plx_Camera_f cf{};
-    EXPECT_FALSE(plx_cameraf_from_camera_q(&c, &cf));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_TYPE);
+    EXPECT_TRUE(fails_with(plx_cameraf_from_camera_q(&c, &cf), PLX_ERROR_ILLEGAL_TYPE));
     c.type = PLX_CUBIC_BSPLINE_CAMERA_INV;
-    EXPECT_FALSE(plx_camera_internalize(&c));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_TYPE);
+    EXPECT_TRUE(fails_with(plx_camera_internalize(&c), PLX_ERROR_ILLEGAL_TYPE));
 
     c = before;
     c.fy = 0;
-    EXPECT_FALSE(plx_camera_internalize(&c));
-    EXPECT_EQ(origin_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_TRUE(fails_with(plx_camera_internalize(&c), PLX_ERROR_DIVISION_BY_ZERO));
     EXPECT_EQ(c.point_project, before.point_project);  // record left as it was
 
     c = before;
     c.fx = 1e300;  // beyond single precision
-    EXPECT_FALSE(plx_cameraf_from_camera_q(&c, &cf));
-    EXPECT_EQ(origin_code(), PLX_ERROR_OUTSIDE_RANGE);
+    EXPECT_TRUE(fails_with(plx_cameraf_from_camera_q(&c, &cf), PLX_ERROR_OUTSIDE_RANGE));
     EXPECT_EQ(cf.type, 0);
     EXPECT_EQ(cf.point_project, nullptr);
 }

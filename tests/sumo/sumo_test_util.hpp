@@ -11,10 +11,14 @@
 
 #include <gtest/gtest.h>
 
+#include "failure_check.hpp"
+
 #include "plano/plano.h"
 #include "plano_host/host.h"
 
 namespace sumo_test {
+
+using plano_test::fails_with;
 
 struct SumoDeleter {
     void operator()(Sumo *s) const { vSumoFree(s, nullptr); }
@@ -31,11 +35,21 @@ struct HostDeleter {
 };
 using HostPtr = std::unique_ptr<PlanoHost, HostDeleter>;
 
+// One iteration over the whole model: lambda 0 is a Gauss-Newton step, apply 0 computes the
+// covariances instead of moving the parameters.
+inline bool iterate(Sumo *sumo, double lambda = 0.0, uint32_t *accepted = nullptr, double *reduction = nullptr,
+                    const ThreadHostInterface *host = nullptr, uint32_t mode = 0, uint32_t apply = 1)
+{
+    return bSumoLevMarqIterationBranchGen(sumo, sumo->root, nullptr, apply, lambda, mode, 0xFFFFFFFFu, 0xFFFFFFFFu,
+                                          accepted, reduction, host) != 0;
+}
+
 inline int32_t error_code()
 {
     Plx_ErrorRecord r;
     return plx_err_get_error(0, &r) ? r.code : 0;
 }
+
 
 // A vector owning its numbers.
 struct Vec {

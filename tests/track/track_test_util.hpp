@@ -1,5 +1,5 @@
-// Helpers shared by the tracking tests: owned images filled from a function, bit masks, pixel
-// reads, the code at the origin of the error trace, and a fixture with a host.
+// Helpers shared by the tracking tests: owned images filled from a function, bit masks and
+// rectangles, pixel reads, the code at the origin of the error trace, and a fixture with a host.
 #ifndef PLANO_TESTS_TRACK_TRACK_TEST_UTIL_HPP
 #define PLANO_TESTS_TRACK_TRACK_TEST_UTIL_HPP
 
@@ -9,11 +9,15 @@
 
 #include <gtest/gtest.h>
 
+#include "failure_check.hpp"
+
 #include "pellux/pellux.h"
 #include "plano/threads.h"
 #include "plano_host/host.h"
 
 namespace track_test {
+
+using plano_test::fails_with;
 
 struct ImageFree {
     void operator()(Plx_Image *im) const { plx_image_free(im); }
@@ -39,6 +43,12 @@ inline Image mask_of(int32_t h, int32_t w, const std::function<bool(int32_t, int
     return make(PLX_FORMAT_GREY, PLX_TYPE_BIT, h, w, [&](int32_t r, int32_t c, int) { return set(r, c) ? 1.0 : 0.0; });
 }
 
+// Bit image of size h x w with the rectangle [x, x + rw) x [y, y + rh) set.
+inline Image rect_mask(int32_t h, int32_t w, int32_t x, int32_t y, int32_t rw, int32_t rh)
+{
+    return mask_of(h, w, [=](int32_t r, int32_t c) { return c >= x && c < x + rw && r >= y && r < y + rh; });
+}
+
 inline double px(const Plx_Image *im, int32_t r, int32_t c, int k = 0)
 {
     double v[4] = {0, 0, 0, 0};
@@ -52,6 +62,7 @@ inline int32_t origin_code()
     plx_err_get_error(0, &r);
     return r.code;
 }
+
 
 // A fixture with a three-job host and a fresh worker pool around every test.
 class HostTest : public ::testing::Test {
