@@ -68,7 +68,7 @@ Plx_Matrix33 to_plx(const M3 &a)
     return p;
 }
 
-// Frame pair k's motion (frame 0 to frame 1) about the frame centre: pair 0 shifts by (7, -4)
+// Motion k of six (frame 0 to frame 1) about the frame centre: motion 0 shifts by (7, -4)
 // pixels, turns 2 degrees, zooms 2 % and adds a little perspective; the others step through
 // shifts, turns (down to -2 degrees), zooms (down to -2 %) and perspectives around it.
 M3 truth(int w, int h, int k)
@@ -79,9 +79,10 @@ M3 truth(int w, int h, int k)
     return mul(shift(w / 2.0 + 7 - 2.5 * k, h / 2.0 - 4 + 1.5 * k), mul(r, shift(-w / 2.0, -h / 2.0)));
 }
 
-// Accuracy is the mean over this many frame pairs: one pair is one noise sample, too few to
-// tell two estimators at their noise floor apart.
-constexpr int kPairs = 6;
+// Accuracy is the mean over this many frame pairs (each of the six motions twice, with noise
+// of their own): one pair is one noise sample, too few to tell two estimators at their noise
+// floor apart.
+constexpr int kPairs = 12;
 
 struct Pair {
     Plx_Image *frame[2] = {nullptr, nullptr};
@@ -89,11 +90,11 @@ struct Pair {
 };
 
 // The photograph stretched over the frame with fine detail added, then the second frame as
-// the first under pair k's motion with gain 1.1 and noise of its own.
+// the first under motion k mod 6 with gain 1.1 and noise of pair k's own.
 Pair make_pair(int w, int h, int k)
 {
     Pair p;
-    p.motion = truth(w, h, k);
+    p.motion = truth(w, h, k % 6);
     Plx_Image *photo = nullptr;
     const std::string path = std::string(__FILE__).substr(0, std::string(__FILE__).rfind('/')) +
                              "/../tests/data/coffee_grey.pgm";
