@@ -268,6 +268,9 @@ sumo::FusedResult pixel_match_fused(SumoStateVector **states, uint32_t n_states,
                                     const double *info, uint32_t info_step, double *chi2, double *jtnj, double *jtnr,
                                     const char *name)
 {
+    // The kernel stacks the terms of the homography and illumination states only; further
+    // states (which the prediction ignores) are left to the general path.
+    if (n_states > 2) return sumo::FusedResult::declined;
     if (!check_pixel_match<W, C>(states, n_states, z, &z->v, name)) return sumo::FusedResult::failed;
     const auto *block = static_cast<const TrackPixelBlock *>(z->user_data);
     const Plx_Image *s = block->search_image;

@@ -243,14 +243,19 @@ TEST(TrackHomogPixelMatch, PixelsLeavingTheWindowOrMaskContributeNothing)
 // The optimiser takes pixel blocks through a fused kernel that never writes the Jacobians
 // out: its information blocks, vectors and cost must be those of the h function's own
 // prediction and Jacobians (up to the single-precision sums), with dropped pixels, with and
-// without the illumination state, for a scaled identity and a diagonal information.
+// without the illumination state, for a scaled identity and a diagonal information. A further
+// state, which the prediction ignores, gets no information.
 TEST(TrackHomogPixelMatch, OptimiserBuildsBlocksAsTheirJacobiansSay)
 {
     for (const PixelFunction &pf : pixel_functions())
-        for (uint32_t n_states : {1u, 2u})
+        for (uint32_t obs_states : {1u, 2u, 3u})
             for (bool diagonal : {false, true}) {
-                SCOPED_TRACE(std::string(pf.name) + (n_states == 2 ? " with gain" : "") + (diagonal ? " diagonal" : ""));
+                const uint32_t n_states = std::min(obs_states, 2u);
+                SCOPED_TRACE(std::string(pf.name) + " states " + std::to_string(obs_states) +
+                             (diagonal ? " diagonal" : ""));
                 PixelCase pc(pf.format, pf.params, pf.type, 2.0);
+                SumoStateVector *extra = make_state(pc.sumo.get(), {0.5, -0.5}, 0);
+                SumoStateVector *with_extra[3] = {pc.states[0], pc.states[1], extra};
                 pc.positions[0] = 15.6f;  // outside the search image
                 pc.mask = plx_image_form_gen_b(nullptr, 16, 16);
                 const double one = 1.0;
@@ -264,11 +269,14 @@ TEST(TrackHomogPixelMatch, OptimiserBuildsBlocksAsTheirJacobiansSay)
                     for (uint32_t r = 0; r < m; ++r) info[r] *= 0.5 + 0.1 * (r % 7);
                 Plx_SquMatrix N;
                 plx_squmat_form_data(&N, diagonal ? PLX_SQUMAT_DIAGONAL : PLX_SQUMAT_SCALED_IDENTITY, m, info.data());
-                SumoObs *o = pSumoObsH(pc.sumo.get(), &z.v, &N, pf.f, nullptr, pc.states, n_states);
+                SumoObs *o = pSumoObsH(pc.sumo.get(), &z.v, &N, pf.f, nullptr, with_extra, obs_states);
                 ASSERT_NE(o, nullptr);
                 o->z.user_data = &pc.block;
                 ASSERT_TRUE(bSumoBuildInformationBlocksBranch(pc.sumo.get(), pc.sumo->root, 1, 0xFFFFFFFFu,
                                                               0xFFFFFFFFu, nullptr));
+                if (obs_states == 3) {
+                    for (uint32_t i = 0; i < 4; ++i) EXPECT_EQ(extra->A_work.data[i], 0.0);
+                }
 
                 // The reference from the h function, in double.
                 Plx_Matrix Jh{}, Ji{};
