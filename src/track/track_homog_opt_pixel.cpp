@@ -2,11 +2,8 @@
 // motion model and channel count predicts a block of reference pixels from the search image
 // warped by the homography state (bilinear interpolation, optional gain and offset) and
 // fills the Jacobians. Everything is single precision and reads the search rows directly.
-#include <immintrin.h>
-
-#include <algorithm>
-#include <climits>
-#include <type_traits>
+// Each function is paired with the fused kernel of pixel_match_lanes.hpp, through which the
+// optimiser evaluates blocks without writing their Jacobians out.
 #include <cmath>
 #include <cstdint>
 #include <cstring>
