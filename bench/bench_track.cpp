@@ -18,15 +18,7 @@
 #include "plano/plano.h"
 #include "plano_host/host.h"
 
-#ifdef PLANO_HAVE_OPENCV
-#pragma GCC diagnostic push
-#pragma GCC diagnostic ignored "-Wpedantic"
-#pragma GCC diagnostic ignored "-Wdeprecated-enum-enum-conversion"
-#include <opencv2/core.hpp>
-#include <opencv2/imgproc.hpp>
-#include <opencv2/video/tracking.hpp>
-#pragma GCC diagnostic pop
-#endif
+#include "opencv_peer.hpp"
 
 namespace {
 
@@ -185,6 +177,19 @@ double corner_error(const M3 &est, const M3 &motion, int x0, int y0)
 
 std::map<std::string, double> g_ms, g_error;
 
+// The mean corner error over the pairs (untimed, every pair once), then the timed frames
+// taking the pairs in turn.
+template <class Frame>
+void run_frames(benchmark::State &state, const std::string &label, const std::vector<Pair> &pairs, Frame &frame)
+{
+    double error = 0;
+    for (const Pair &p : pairs) error += frame(p) / double(pairs.size());
+    std::size_t next = 0;
+    for (auto _ : state) frame(pairs[next++ % pairs.size()]);
+    state.counters["corner_px"] = error;
+    g_error[label] = error;
+}
+
 void track_plano(benchmark::State &state, std::string key, int w, int h, int count, uint32_t jobs)
 {
     const std::vector<Pair> &pairs = pairs_of(w, h);
@@ -222,12 +227,7 @@ void track_plano(benchmark::State &state, std::string key, int w, int h, int cou
         vTrackFree(track);
         return error;
     };
-    double error = 0;
-    for (const Pair &p : pairs) error += frame(p) / kPairs;
-    std::size_t next = 0;
-    for (auto _ : state) frame(pairs[next++ % pairs.size()]);
-    state.counters["corner_px"] = error;
-    g_error["plano/" + key] = error;
+    run_frames(state, "plano/" + key, pairs, frame);
     for (Plx_Image *m : masks) plx_image_free(m);
     vThreadedWorkerPoolFree();
     plano_host_free(host);
@@ -287,12 +287,7 @@ void track_ecc(benchmark::State &state, std::string key, int w, int h, int count
         }
         return error;
     };
-    double error = 0;
-    for (const Pair &p : pairs) error += frame(p) / kPairs;
-    std::size_t next = 0;
-    for (auto _ : state) frame(pairs[next++ % pairs.size()]);
-    state.counters["corner_px"] = error;
-    g_error["ecc/" + key] = error;
+    run_frames(state, "ecc/" + key, pairs, frame);
 }
 #endif
 

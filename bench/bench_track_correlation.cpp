@@ -8,15 +8,7 @@
 #include "plano/track_correlation.h"
 #include "plano_host/host.h"
 
-#ifdef PLANO_HAVE_OPENCV
-#pragma GCC diagnostic push
-// OpenCV's headers use C11 atomics and mix enumerations, which our warnings reject.
-#pragma GCC diagnostic ignored "-Wpedantic"
-#pragma GCC diagnostic ignored "-Wdeprecated-enum-enum-conversion"
-#include <opencv2/core.hpp>
-#include <opencv2/imgproc.hpp>
-#pragma GCC diagnostic pop
-#endif
+#include "opencv_peer.hpp"
 
 namespace {
 

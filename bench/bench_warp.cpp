@@ -13,10 +13,7 @@
 #include "plano/plano.h"
 #include "plano_host/host.h"
 
-#ifdef PLANO_HAVE_OPENCV
-#include <opencv2/core.hpp>
-#include <opencv2/imgproc.hpp>
-#endif
+#include "opencv_peer.hpp"
 
 namespace {
 
