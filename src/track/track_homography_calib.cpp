@@ -149,14 +149,28 @@ M3 normalised_camera_matrix(const Plx_Camera *camera)
     return k;
 }
 
-// A symmetric copy of a region's information matrix over caller storage (81 doubles).
-void information_copy(const Plx_SquMatrix *information, uint32_t n, Plx_SquMatrix *copy, double *storage)
-{
-    plx_squmat_form_data(copy, PLX_SQUMAT_SYMMETRIC, n, storage);
-    for (uint32_t i = 0; i < n; ++i)
-        for (uint32_t j = 0; j < n; ++j)
-            storage[i * n + j] = information != nullptr ? plx_squmat_get(information, i, j) : 0.0;
-}
+// A region's motion being converted: its model, homography and a symmetric copy of its
+// information matrix (zero when it has none).
+struct RegionMotion {
+    uint32_t model, n;
+    M3 h;
+    double storage[81];
+    Plx_SquMatrix info{};
+
+    explicit RegionMotion(const TrackRegion *region)
+        : model(region->settings.motion_model), n(plano::track::model_parameter_count(model)), h(region->homography)
+    {
+        plx_squmat_form_data(&info, PLX_SQUMAT_SYMMETRIC, n, storage);
+        for (uint32_t i = 0; i < n; ++i)
+            for (uint32_t j = 0; j < n; ++j)
+                storage[i * n + j] = region->information != nullptr ? plx_squmat_get(region->information, i, j) : 0.0;
+    }
+    // The parameters shrink by f: their information grows by f^2.
+    void scale_information(double f)
+    {
+        for (uint32_t i = 0; i < n * n; ++i) storage[i] *= f * f;
+    }
+};
 
 // Stores the converted homography and information into the region.
 bool store_region(TrackRegion *region, const M3 &h, const Plx_SquMatrix &information, bool to_window)
@@ -179,48 +193,38 @@ namespace plano::track {
 bool region_to_window_pixels(const Track *track, TrackRegion *region, const char *function)
 {
     (void)function;
-    const uint32_t model = region->settings.motion_model;
-    const uint32_t n = model_parameter_count(model);
-    M3 h = region->homography;
-    double storage[81];
-    Plx_SquMatrix info{};
-    information_copy(region->information, n, &info, storage);
+    RegionMotion m(region);
     double scale = 1.0;
     // The homography arrives with any scale; its information is for that scale.
-    if (!bCorrectHomography(model, &h, &scale)) return false;
-    for (uint32_t i = 0; i < n * n; ++i) storage[i] *= scale * scale;
-    if (!bTrackApplyCalibToHomography(&h, &info, model, &track->current_camera, region, 1) ||
-        !bTrackApplyOffsetsToHomography(&h, &info, model, region->search_origin, track->current_camera.zh,
+    if (!bCorrectHomography(m.model, &m.h, &scale)) return false;
+    m.scale_information(scale);
+    if (!bTrackApplyCalibToHomography(&m.h, &m.info, m.model, &track->current_camera, region, 1) ||
+        !bTrackApplyOffsetsToHomography(&m.h, &m.info, m.model, region->search_origin, track->current_camera.zh,
                                         region->template_origin, region->camera.zh, 1) ||
-        !bCorrectHomography(model, &h, nullptr))
+        !bCorrectHomography(m.model, &m.h, nullptr))
         return false;
-    return store_region(region, h, info, true);
+    return store_region(region, m.h, m.info, true);
 }
 
 bool region_to_calibrated(const Track *track, TrackRegion *region, const char *function)
 {
-    const uint32_t model = region->settings.motion_model;
-    const uint32_t n = model_parameter_count(model);
-    M3 h = region->homography;
-    double storage[81];
-    Plx_SquMatrix info{};
-    information_copy(region->information, n, &info, storage);
-    if (!bTrackApplyOffsetsToHomography(&h, &info, model, region->search_origin, track->current_camera.zh,
+    RegionMotion m(region);
+    if (!bTrackApplyOffsetsToHomography(&m.h, &m.info, m.model, region->search_origin, track->current_camera.zh,
                                         region->template_origin, region->camera.zh, 0) ||
-        !bTrackApplyCalibToHomography(&h, &info, model, &track->current_camera, region, 0))
+        !bTrackApplyCalibToHomography(&m.h, &m.info, m.model, &track->current_camera, region, 0))
         return false;
-    if (model == TRACK_MODEL_PROJ) {
-        // Unit Frobenius norm; the parameters shrink by f, so their information grows by f^2.
-        const double f = plx_mat33_Fnorm_s(&h);
+    if (m.model == TRACK_MODEL_PROJ) {
+        // Unit Frobenius norm.
+        const double f = plx_mat33_Fnorm_s(&m.h);
         if (f == 0.0 || !std::isfinite(f)) {
             PLX_ERR_START_AS(function, PLX_ERROR_DIVISION_BY_ZERO, "homography is zero", 0);
             return false;
         }
-        plx_mat33_scale_s(&h, 1.0 / f, &h);
-        for (uint32_t i = 0; i < n * n; ++i) storage[i] *= f * f;
+        plx_mat33_scale_s(&m.h, 1.0 / f, &m.h);
+        m.scale_information(f);
     }
-    if (!bCorrectHomography(model, &h, nullptr)) return false;
-    return store_region(region, h, info, false);
+    if (!bCorrectHomography(m.model, &m.h, nullptr)) return false;
+    return store_region(region, m.h, m.info, false);
 }
 
 }  // namespace plano::track
