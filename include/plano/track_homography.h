@@ -38,7 +38,13 @@ extern "C" {
 /* The user data of one pixel-match observation: the block's homogeneous coordinate, the
  * search pixel image (single-precision float, grey, RGB or RGBA) and its optional bit mask at
  * the level, and the positions (x, y pairs) of the block's used reference pixels, in the
- * order of the observation vector. */
+ * order of the observation vector.
+ *
+ * The optional gradient images (both or neither; the search image's format, type and size)
+ * give the image derivatives of the Jacobians: they are interpolated bilinearly at the warped
+ * position like the values. The tracker fills them with bTrackSearchGradients. Without them
+ * the derivatives are those of the bilinear interpolant itself, whose fixed point under noise
+ * in the search image leans towards half-pixel positions. */
 typedef struct TrackPixelBlock {
     double zh;
     float zh_f;
@@ -46,6 +52,8 @@ typedef struct TrackPixelBlock {
     const Plx_Image *search_mask;   /* null: every search pixel may be used */
     const float *positions;         /* 2 x no_pixels floats */
     uint32_t no_pixels;
+    const Plx_Image *search_gradient_x;  /* null: derivatives of the interpolant */
+    const Plx_Image *search_gradient_y;
 } TrackPixelBlock;
 
 /* User data of a constraint-point observation whose target is estimated: zh, and the origin
@@ -118,7 +126,8 @@ PLANO_API Plx_Bool bTransScaleHomogH(Sumo *sumo, SumoWorkspace *workspace, SumoS
  * States: (homography, illumination or null). z holds the reference values of the block's
  * pixels (R, G, B per pixel for the RGB functions); z's user data is a TrackPixelBlock. A
  * pixel whose bilinear footprint leaves the search image or its mask predicts its own
- * observed value with zero derivatives. Arithmetic is single precision. */
+ * observed value with zero derivatives. The image derivatives come from the block's gradient
+ * images when it has them, else from the interpolant. Arithmetic is single precision. */
 PLANO_API Plx_Bool bPixelMatchAffineH(Sumo *sumo, SumoWorkspace *workspace, SumoStateVector **states,
                                       uint32_t n_states, const SumoVector *z, Plx_Vector *h,
                                       Plx_Matrix **jacobians);
@@ -150,6 +159,14 @@ PLANO_API Plx_Bool bPixelMatchTranslateRGBH(Sumo *sumo, SumoWorkspace *workspace
                                             const SumoVector *z, Plx_Vector *h,
                                             Plx_Matrix **jacobians);
 
+/* The image derivatives of a search pixel image (float, grey, RGB or RGBA) into the image
+ * records gx and gy, which are (re)formed with the image's format, type and size. Per channel
+ * and pixel: half the difference of the two neighbours along the axis when both are in the
+ * image and the mask (null: all set), the one-sided difference when only one is, else 0.
+ * Returns 1, or 0 with code 32 for an unsupported image, 7 for a mask that does not fit. */
+PLANO_API Plx_Bool bTrackSearchGradients(const Plx_Image *image, const Plx_Image *mask, Plx_Image *gx,
+                                         Plx_Image *gy);
+
 /* One region's block observations at a level. */
 typedef struct TrackPixelObsJob {
     Sumo *sumo;
@@ -161,6 +178,8 @@ typedef struct TrackPixelObsJob {
     const Plx_Image *reference_mask;      /* may be null */
     const Plx_Image *search;              /* float pixel image of the search window */
     const Plx_Image *search_mask;         /* may be null */
+    const Plx_Image *search_gradient_x;   /* may be null (both or neither): see TrackPixelBlock */
+    const Plx_Image *search_gradient_y;
     double zh;                            /* homogeneous coordinate at the level */
     uint32_t block_size;                  /* at least 1 */
     uint32_t sampling;                    /* already shifted by the level */

@@ -44,6 +44,7 @@ struct BlockArgs {
     float p[9];
     float gain, offset, zh;
     const float *data;   // search row 0
+    const float *grad_x, *grad_y;  // gradient rows 0 at the search image's stride, or null
     int32_t stride;      // floats per search row
     int32_t step;        // floats per search pixel
     float wlim, hlim;    // width - 1, height - 1

@@ -22,6 +22,7 @@ struct RegionWork {
     Plx_Image *ref_pixels = nullptr;
     Plx_Image *search_pixels = nullptr;
     bool ref_owned = false, search_owned = false;
+    Plx_Image gradient_x{}, gradient_y{};  // of the search pixels
     SumoStateVector *homography_state = nullptr;
     SumoStateVector *illumination_state = nullptr;
     TrackPixelObsJob job{};
@@ -50,6 +51,8 @@ struct LevelModel {
             if (r.region) r.region->state = nullptr;
             if (r.ref_owned) plx_image_free(r.ref_pixels);
             if (r.search_owned) plx_image_free(r.search_pixels);
+            plx_image_free(&r.gradient_x);
+            plx_image_free(&r.gradient_y);
         }
         if (track->constraint_points)
             for (Plx_ListNode *n = track->constraint_points->head; n; n = n->next)
@@ -142,6 +145,11 @@ bool build_region(LevelModel &lm, RegionWork &w, uint32_t level)
     w.search_pixels = pgiSmoothImage(search->image, search->mask, set.smoothing_passes, search_buffer, nullptr, lm.host);
     w.search_owned = w.search_pixels != nullptr && w.search_pixels != search_buffer;
     if (w.search_pixels == nullptr) return false;
+    // The interpolated central differences make the estimate unbiased under noise; coarser
+    // levels keep the interpolant's own derivatives, whose steps agree with the cost, for a
+    // wide pull-in while the motion is still far off.
+    const bool gradients = level == lm.track->termination_level;
+    if (gradients && !bTrackSearchGradients(w.search_pixels, search->mask, &w.gradient_x, &w.gradient_y)) return false;
 
     TrackPixelObsJob &job = w.job;
     job.sumo = sumo;
@@ -153,6 +161,8 @@ bool build_region(LevelModel &lm, RegionWork &w, uint32_t level)
     job.reference_mask = ref->mask;
     job.search = w.search_pixels;
     job.search_mask = search->mask;
+    job.search_gradient_x = gradients ? &w.gradient_x : nullptr;
+    job.search_gradient_y = gradients ? &w.gradient_y : nullptr;
     job.zh = zh;
     job.block_size = std::max(set.block_size >> level, 1u);
     job.sampling = set.pixel_sampling >> level;

@@ -224,6 +224,8 @@ PLANO_API Plx_Bool gbBuildPixelObservations(void *argument)
             b.zh_f = float(job->zh);
             b.search_image = job->search;
             b.search_mask = search_mask;
+            b.search_gradient_x = job->search_gradient_x;
+            b.search_gradient_y = job->search_gradient_y;
             b.positions = block_pos;
             b.no_pixels = n;
             o->z.user_data = &b;

@@ -1,7 +1,7 @@
 // The pixel-match observation functions: the tracker's innermost loop. One template per
 // motion model and channel count predicts a block of reference pixels from the search image
 // warped by the homography state (bilinear interpolation, optional gain and offset) and
-// fills the Jacobians. Everything is single precision and reads the search rows directly.
+// fills the Jacobians (image derivatives from the block's gradient images when it has them). Everything is single precision and reads the search rows directly.
 // Each function is paired with the fused kernel of pixel_match_lanes.hpp, through which the
 // optimiser evaluates blocks without writing their Jacobians out.
 #include <cmath>
@@ -127,6 +127,15 @@ bool check_pixel_match(SumoStateVector **states, uint32_t n_states, const SumoVe
         PLX_ERR_START_AS(name, PLX_ERROR_INCOMPATIBLE, "search mask does not fit the image", 0);
         return false;
     }
+    const Plx_Image *gx = block->search_gradient_x, *gy = block->search_gradient_y;
+    auto fits = [s](const Plx_Image *g) {
+        return g->data != nullptr && g->type == PLX_TYPE_FLOAT && g->format == s->format && g->width == s->width &&
+               g->height == s->height;
+    };
+    if ((gx == nullptr) != (gy == nullptr) || (gx != nullptr && !(fits(gx) && fits(gy)))) {
+        PLX_ERR_START_AS(name, PLX_ERROR_INCOMPATIBLE, "search gradients do not fit the image", 0);
+        return false;
+    }
     return true;
 }
 
@@ -144,7 +153,9 @@ public:
           mask_(block->search_mask),
           wlim_(float(block->search_image->width - 1)),
           hlim_(float(block->search_image->height - 1)),
-          zh_(block->zh_f)
+          zh_(block->zh_f),
+          grad_x_(block->search_gradient_x),
+          grad_y_(block->search_gradient_y)
     {
         for (uint32_t k = 0; k < warp_params<W>(); ++k) p_[k] = float(hs->x.v.data[k]);
     }
@@ -169,6 +180,12 @@ public:
         fy_ = uy - float(cy);
         r0_ = reinterpret_cast<const float *>(data_ + std::ptrdiff_t(cy) * stride_) + std::size_t(cx) * step_;
         r1_ = reinterpret_cast<const float *>(data_ + std::ptrdiff_t(cy + 1) * stride_) + std::size_t(cx) * step_;
+        if (grad_x_ != nullptr) {
+            gx0_ = static_cast<const float *>(plx_image_row(grad_x_, cy)) + std::size_t(cx) * step_;
+            gx1_ = static_cast<const float *>(plx_image_row(grad_x_, cy + 1)) + std::size_t(cx) * step_;
+            gy0_ = static_cast<const float *>(plx_image_row(grad_y_, cy)) + std::size_t(cx) * step_;
+            gy1_ = static_cast<const float *>(plx_image_row(grad_y_, cy + 1)) + std::size_t(cx) * step_;
+        }
         return true;
     }
 
@@ -178,9 +195,21 @@ public:
     {
         const float s00 = r0_[ch], s01 = r0_[step_ + ch];
         const float s10 = r1_[ch], s11 = r1_[step_ + ch];
-        S = (1.f - fy_) * ((1.f - fx_) * s00 + fx_ * s01) + fy_ * ((1.f - fx_) * s10 + fx_ * s11);
-        dSx = gain_ * ((s01 - s00) * (1.f - fy_) + (s11 - s10) * fy_);
-        dSy = gain_ * ((s10 - s00) * (1.f - fx_) + (s11 - s01) * fx_);
+        S = interpolate(r0_, r1_, ch);
+        if (grad_x_ != nullptr) {
+            dSx = gain_ * interpolate(gx0_, gx1_, ch);
+            dSy = gain_ * interpolate(gy0_, gy1_, ch);
+        } else {
+            dSx = gain_ * ((s01 - s00) * (1.f - fy_) + (s11 - s10) * fy_);
+            dSy = gain_ * ((s10 - s00) * (1.f - fx_) + (s11 - s01) * fx_);
+        }
+    }
+
+    // Channel ch of an image at the located footprint (rows a and b).
+    float interpolate(const float *a, const float *b, uint32_t ch) const
+    {
+        return (1.f - fy_) * ((1.f - fx_) * a[ch] + fx_ * a[step_ + ch]) +
+               fy_ * ((1.f - fx_) * b[ch] + fx_ * b[step_ + ch]);
     }
 
     float predict(float S) const { return gain_ * S + offset_; }
@@ -197,8 +226,10 @@ private:
     const Plx_Image *mask_;
     float wlim_, hlim_, zh_;
     WarpLocal local_{};
+    const Plx_Image *grad_x_, *grad_y_;
     float fx_ = 0.f, fy_ = 0.f;
     const float *r0_ = nullptr, *r1_ = nullptr;
+    const float *gx0_ = nullptr, *gx1_ = nullptr, *gy0_ = nullptr, *gy1_ = nullptr;
 };
 
 template <Warp W, uint32_t C>
@@ -274,6 +305,9 @@ sumo::FusedResult pixel_match_fused(SumoStateVector **states, uint32_t n_states,
     // The lanes index the search image with 32-bit offsets.
     const std::size_t floats = std::size_t(s->height) * std::size_t(s->stride) / sizeof(float);
     if (s->stride % int32_t(sizeof(float)) != 0 || floats >= std::size_t(INT32_MAX)) return sumo::FusedResult::declined;
+    // The lanes read the gradients at the search image's offsets.
+    const Plx_Image *gx = block->search_gradient_x, *gy = block->search_gradient_y;
+    if (gx != nullptr && (gx->stride != s->stride || gy->stride != s->stride)) return sumo::FusedResult::declined;
     const SumoStateVector *is = n_states > 1 ? states[1] : nullptr;
     BlockArgs a{};
     for (uint32_t k = 0; k < warp_params<W>(); ++k) a.p[k] = float(states[0]->x.v.data[k]);
@@ -281,6 +315,8 @@ sumo::FusedResult pixel_match_fused(SumoStateVector **states, uint32_t n_states,
     a.offset = is ? float(is->x.v.data[1]) : 0.f;
     a.zh = block->zh_f;
     a.data = static_cast<const float *>(s->data);
+    a.grad_x = gx != nullptr ? static_cast<const float *>(gx->data) : nullptr;
+    a.grad_y = gy != nullptr ? static_cast<const float *>(gy->data) : nullptr;
     a.stride = s->stride / int32_t(sizeof(float));
     a.step = int32_t(plx_image_format_channels(s->format));
     a.wlim = float(s->width - 1);

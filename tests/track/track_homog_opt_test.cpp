@@ -18,9 +18,12 @@
 #include "plano/track.h"
 #include "plano/track_homography.h"
 #include "plano_host/host.h"
+#include "failure_check.hpp"
 #include "track/pixel_match_lanes.hpp"
 
 namespace {
+
+using plano_test::fails_with;
 
 int32_t origin_code()
 {
@@ -89,7 +92,7 @@ struct PixelCase {
         channels = format == PLX_FORMAT_GREY ? 1 : 3;
         for (int y = 2; y <= 6; y += 2)
             for (int x = 2; x <= 7; ++x) positions.insert(positions.end(), {x + 0.5f, y + 0.5f});
-        block = {zh, float(zh), search.get(), nullptr, positions.data(), uint32_t(positions.size() / 2)};
+        block = {zh, float(zh), search.get(), nullptr, positions.data(), uint32_t(positions.size() / 2), nullptr, nullptr};
         states[0] = make_state(sumo.get(), std::move(params), type);
         states[1] = make_state(sumo.get(), {1.2, 0.1}, 0);
         plx_vec_form(&z, block.no_pixels * channels);
@@ -99,7 +102,17 @@ struct PixelCase {
     {
         plx_vec_free(&z);
         plx_image_free(mask);
+        plx_image_free(&gradient_x);
+        plx_image_free(&gradient_y);
     }
+    // Gives the block the search image's central-difference gradients (after any mask).
+    void use_gradients()
+    {
+        ASSERT_TRUE(bTrackSearchGradients(search.get(), mask, &gradient_x, &gradient_y));
+        block.search_gradient_x = &gradient_x;
+        block.search_gradient_y = &gradient_y;
+    }
+    Plx_Image gradient_x{}, gradient_y{};
     SumoVector zvec()
     {
         SumoVector v{};
@@ -196,6 +209,84 @@ TEST(TrackHomogPixelMatch, PredictsBilinearValueWithGainAndOffset)
     plx_vec_free(&h);
 }
 
+// With gradient images the derivatives are the interpolated central differences: for a
+// translation at zh 2 with gain 1.2, J = 1.2 * 2 * (gx, gy) at the footprint, per channel.
+TEST(TrackHomogPixelMatch, GradientImagesGiveInterpolatedCentralDifferences)
+{
+    for (Plx_ImageFormat format : {PLX_FORMAT_GREY, PLX_FORMAT_RGB}) {
+        PixelCase pc(format, {0.15, 0.175}, TRACK_STATE_TRANSLATE, 2.0);
+        pc.use_gradients();
+        SumoVector z = pc.zvec();
+        const uint32_t C = pc.channels;
+        Plx_Matrix J0{}, J1{};
+        plx_mat_form(&J0, z.v.rows, 2);
+        plx_mat_form(&J1, z.v.rows, 2);
+        Plx_Matrix *J[2] = {&J0, &J1};
+        Plx_Vector h{};
+        plx_vec_form(&h, z.v.rows);
+        const SumoHFunction f = C == 1 ? bPixelMatchTranslateH : bPixelMatchTranslateRGBH;
+        ASSERT_TRUE(f(nullptr, nullptr, pc.states, 2, &z, &h, J));
+        auto at = [&](int r, int c, uint32_t k) {
+            return double(static_cast<float *>(plx_image_row(pc.search.get(), r))[c * C + k]);
+        };
+        // Pixel 0 at (2.5, 2.5) lands at (2.8, 2.85): cell (2, 2), fractions (0.3, 0.35).
+        const double fx = 0.3, fy = 0.35;
+        for (uint32_t k = 0; k < C; ++k) {
+            auto gx = [&](int r, int c) { return (at(r, c + 1, k) - at(r, c - 1, k)) / 2; };
+            auto gy = [&](int r, int c) { return (at(r + 1, c, k) - at(r - 1, c, k)) / 2; };
+            auto lerp = [&](auto g) {
+                return (1 - fy) * ((1 - fx) * g(2, 2) + fx * g(2, 3)) + fy * ((1 - fx) * g(3, 2) + fx * g(3, 3));
+            };
+            EXPECT_NEAR(J0.data[k * 2 + 0], 1.2 * 2.0 * lerp(gx), 1e-5) << "channel " << k;
+            EXPECT_NEAR(J0.data[k * 2 + 1], 1.2 * 2.0 * lerp(gy), 1e-5) << "channel " << k;
+        }
+        // On a smooth texture they are close to the interpolant's own derivatives.
+        expect_jacobians(f, pc.states, 2, z, 2e-4, 5e-2);
+        plx_mat_free(&J0), plx_mat_free(&J1), plx_vec_free(&h);
+    }
+}
+
+// Central differences inside, one-sided at the image edges and next to cleared mask bits,
+// zero with no usable neighbour; gradient images that do not fit the search image fail.
+TEST(TrackHomogPixelMatch, SearchGradientsAtEdgesAndMasks)
+{
+    ImagePtr im(plx_image_form_gen_gl_f(nullptr, 3, 4));
+    const float v[3][4] = {{1, 2, 4, 8}, {0, 3, 9, 27}, {5, 5, 6, 1}};
+    for (int r = 0; r < 3; ++r)
+        for (int c = 0; c < 4; ++c) static_cast<float *>(plx_image_row(im.get(), r))[c] = v[r][c];
+    ImagePtr mask(plx_image_form_gen_b(nullptr, 3, 4));
+    const double one = 1.0;
+    plx_image_fill_const(mask.get(), &one);
+    plx_image_set_bit(mask.get(), 1, 2, 0);  // (row 1, column 2) cleared
+    Plx_Image gx{}, gy{};
+    ASSERT_TRUE(bTrackSearchGradients(im.get(), mask.get(), &gx, &gy));
+    auto GX = [&](int r, int c) { return static_cast<float *>(plx_image_row(&gx, r))[c]; };
+    auto GY = [&](int r, int c) { return static_cast<float *>(plx_image_row(&gy, r))[c]; };
+    EXPECT_EQ(GX(0, 0), 1.f);    // right only
+    EXPECT_EQ(GX(0, 1), 1.5f);   // (4 - 1) / 2
+    EXPECT_EQ(GX(0, 3), 4.f);    // left only
+    EXPECT_EQ(GX(1, 1), 3.f);    // right neighbour cleared: 3 - 0
+    EXPECT_EQ(GX(1, 3), 0.f);    // left neighbour cleared, no right one
+    EXPECT_EQ(GX(1, 2), 0.f);    // cleared pixel
+    EXPECT_EQ(GY(0, 0), -1.f);   // below only
+    EXPECT_EQ(GY(1, 0), 2.f);    // (5 - 1) / 2
+    EXPECT_EQ(GY(2, 2), 0.f);    // pixel above cleared, no row below
+    EXPECT_EQ(GY(0, 2), 0.f);    // pixel below cleared, no row above
+    EXPECT_EQ(GY(2, 3), -26.f);  // above only: 1 - 27
+    // Without a mask every neighbour counts.
+    ASSERT_TRUE(bTrackSearchGradients(im.get(), nullptr, &gx, &gy));
+    EXPECT_EQ(GX(1, 3), 18.f);
+    EXPECT_EQ(GY(1, 2), 1.f);
+    // Unfit arguments.
+    EXPECT_TRUE(fails_with(bTrackSearchGradients(im.get(), nullptr, &gx, &gx), PLX_ERROR_INCOMPATIBLE));
+    ImagePtr small(plx_image_form_gen_b(nullptr, 2, 4));
+    EXPECT_TRUE(fails_with(bTrackSearchGradients(im.get(), small.get(), &gx, &gy), PLX_ERROR_INCOMPATIBLE));
+    ImagePtr bytes(plx_image_form_gen_gl_uc(nullptr, 3, 4));
+    EXPECT_TRUE(fails_with(bTrackSearchGradients(bytes.get(), nullptr, &gx, &gy), PLX_ERROR_ILLEGAL_ARGUMENT));
+    plx_image_free(&gx);
+    plx_image_free(&gy);
+}
+
 TEST(TrackHomogPixelMatch, PixelsLeavingTheWindowOrMaskContributeNothing)
 {
     for (const PixelFunction &pf : pixel_functions()) {
@@ -249,10 +340,11 @@ TEST(TrackHomogPixelMatch, OptimiserBuildsBlocksAsTheirJacobiansSay)
 {
     for (const PixelFunction &pf : pixel_functions())
         for (uint32_t obs_states : {1u, 2u, 3u})
-            for (bool diagonal : {false, true}) {
+            for (int variant = 0; variant < 3; ++variant) {
+                const bool diagonal = variant == 1, gradients = variant == 2;
                 const uint32_t n_states = std::min(obs_states, 2u);
                 SCOPED_TRACE(std::string(pf.name) + " states " + std::to_string(obs_states) +
-                             (diagonal ? " diagonal" : ""));
+                             (diagonal ? " diagonal" : "") + (gradients ? " gradients" : ""));
                 PixelCase pc(pf.format, pf.params, pf.type, 2.0);
                 SumoStateVector *extra = make_state(pc.sumo.get(), {0.5, -0.5}, 0);
                 SumoStateVector *with_extra[3] = {pc.states[0], pc.states[1], extra};
@@ -262,6 +354,7 @@ TEST(TrackHomogPixelMatch, OptimiserBuildsBlocksAsTheirJacobiansSay)
                 plx_image_fill_const(pc.mask, &one);
                 plx_image_set_bit(pc.mask, 3, 4, 0);  // drops pixel 2
                 pc.block.search_mask = pc.mask;
+                if (gradients) pc.use_gradients();
                 SumoVector z = pc.zvec();
                 const uint32_t m = z.v.rows, n = pc.states[0]->x.v.rows;
                 std::vector<double> info(m, 1.0 / (0.02 * 0.02));
@@ -361,7 +454,7 @@ TEST(TrackHomogPixelMatch, PortableAndVectorKernelsGiveTheSameBits)
     std::uniform_real_distribution<float> u(0.f, 1.f);
     for (Plx_ImageFormat format : {PLX_FORMAT_GREY, PLX_FORMAT_RGBA})
         for (uint32_t n_px : {5u, 61u})
-            for (int variant = 0; variant < 4; ++variant) {
+            for (int variant = 0; variant < 8; ++variant) {
                 SCOPED_TRACE(std::to_string(format) + " " + std::to_string(n_px) + " " + std::to_string(variant));
                 ImagePtr search = float_image(40, 48, format);
                 ImagePtr mask(plx_image_form_gen_b(nullptr, 40, 48));
@@ -384,6 +477,12 @@ TEST(TrackHomogPixelMatch, PortableAndVectorKernelsGiveTheSameBits)
                 a.z = z.data();
                 a.info = info.data();
                 a.info_step = variant & 2 ? 1 : 0;
+                Plx_Image gx{}, gy{};
+                if (variant & 4) {
+                    ASSERT_TRUE(bTrackSearchGradients(search.get(), a.mask, &gx, &gy));
+                    a.grad_x = static_cast<const float *>(gx.data);
+                    a.grad_y = static_cast<const float *>(gy.data);
+                }
                 for (bool terms : {true, false}) {
                     a.terms = terms;
                     if (format == PLX_FORMAT_GREY) {
@@ -400,6 +499,8 @@ TEST(TrackHomogPixelMatch, PortableAndVectorKernelsGiveTheSameBits)
                         expect_same_lanes_with_and_without_gain<W::translate, 3>(a, {0.7f, 0.4f});
                     }
                 }
+                plx_image_free(&gx);
+                plx_image_free(&gy);
             }
 }
 
@@ -416,6 +517,17 @@ TEST(TrackHomogPixelMatch, RejectsBlocksThatDoNotFit)
     EXPECT_EQ(origin_code(), PLX_ERROR_INCOMPATIBLE);
     EXPECT_FALSE(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, nullptr, &h, nullptr));
     EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    // Gradient images: both or neither, each like the search image.
+    z.v.rows += 1;
+    pc.use_gradients();
+    ASSERT_TRUE(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr));
+    pc.block.search_gradient_y = nullptr;
+    EXPECT_TRUE(fails_with(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr),
+                           PLX_ERROR_INCOMPATIBLE));
+    ImagePtr grey = float_image(16, 16, PLX_FORMAT_GREY);
+    pc.block.search_gradient_y = grey.get();
+    EXPECT_TRUE(fails_with(bPixelMatchTranslateRGBH(nullptr, nullptr, pc.states, 2, &z, &h, nullptr),
+                           PLX_ERROR_INCOMPATIBLE));
     plx_vec_free(&h);
 }
 
@@ -921,6 +1033,37 @@ TEST(TrackHomogMatch, RecoversKnownMotionForEveryModel)
         EXPECT_GT(plx_squmat_get(region->information, 0, 0), 0.0);
         EXPECT_EQ(region->state, nullptr);
     }
+}
+
+// Noise in the current frame must not pull the estimate towards half-pixel positions (where
+// interpolation averages the most noise away): a shift with quarter-pixel fractions comes
+// back without bias, averaged over noise draws.
+TEST(TrackHomogMatch, NoiseDoesNotPullTowardsHalfPixels)
+{
+    const Plx_Matrix33 H = mat33({1, 0, 1.25, 0, 1, -0.75, 0, 0, 1});
+    const int draws = 16;
+    double bias[2] = {0, 0};
+    std::mt19937 rng(11);
+    std::normal_distribution<float> noise(0.f, 0.04f);
+    for (int d = 0; d < draws; ++d) {
+        Frames f(H);
+        for (int32_t r = 0; r < kSize; ++r)
+            for (int32_t c = 0; c < kSize; ++c) static_cast<float *>(plx_image_row(f.current.get(), r))[c] += noise(rng);
+        Settings s;
+        s.model = TRACK_MODEL_TRANSLATE;
+        TrackPtr track = make_track(f, s);
+        auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+        ASSERT_TRUE(bTrackHomogOptimise(track.get(), 30, 1e-3, 10.0, nullptr, nullptr));
+        const double x = kBox0 + kBox / 2.0, y = x;
+        double u, v;
+        apply(region->homography, x - region->template_origin[0], y - region->template_origin[1], &u, &v);
+        bias[0] += (u + region->search_origin[0] - (x + 1.25)) / draws;
+        bias[1] += (v + region->search_origin[1] - (y - 0.75)) / draws;
+    }
+    // The derivatives of the interpolant itself lean 0.015 to 0.035 pixels towards the half
+    // pixel here; the spread of the mean over the draws is about 0.004.
+    EXPECT_LT(std::fabs(bias[0]), 0.015);
+    EXPECT_LT(std::fabs(bias[1]), 0.015);
 }
 
 // Two regions handed the same caller buffers: each keeps its own pixel images.
