@@ -71,10 +71,10 @@ M3 truth(int w, int h, int k)
     return mul(shift(w / 2.0 + 7 - 2.5 * k, h / 2.0 - 4 + 1.5 * k), mul(r, shift(-w / 2.0, -h / 2.0)));
 }
 
-// Accuracy is the mean over this many frame pairs (each of the six motions twice, with noise
-// of their own): one pair is one noise sample, too few to tell two estimators at their noise
-// floor apart.
-constexpr int kPairs = 12;
+// Accuracy is the mean over this many frame pairs (each of the six motions four times, with
+// noise of their own): one pair is one noise sample, too few to tell two estimators at their
+// noise floor apart.
+constexpr int kPairs = 24;
 
 struct Pair {
     Plx_Image *frame[2] = {nullptr, nullptr};
@@ -175,19 +175,27 @@ double corner_error(const M3 &est, const M3 &motion, int x0, int y0)
     return sum / 4;
 }
 
-std::map<std::string, double> g_ms, g_error;
+std::map<std::string, double> g_ms;
+std::map<std::string, std::vector<double>> g_errors;  // per pair
 
-// The mean corner error over the pairs (untimed, every pair once), then the timed frames
-// taking the pairs in turn.
+double mean(const std::vector<double> &v)
+{
+    double sum = 0;
+    for (double x : v) sum += x;
+    return v.empty() ? 0.0 : sum / double(v.size());
+}
+
+// The corner error of every pair (untimed, once per case), then the timed frames taking the
+// pairs in turn.
 template <class Frame>
 void run_frames(benchmark::State &state, const std::string &label, const std::vector<Pair> &pairs, Frame &frame)
 {
-    double error = 0;
-    for (const Pair &p : pairs) error += frame(p) / double(pairs.size());
+    std::vector<double> &errors = g_errors[label];
+    if (errors.empty())
+        for (const Pair &p : pairs) errors.push_back(frame(p));
     std::size_t next = 0;
     for (auto _ : state) frame(pairs[next++ % pairs.size()]);
-    state.counters["corner_px"] = error;
-    g_error[label] = error;
+    state.counters["corner_px"] = mean(errors);
 }
 
 void track_plano(benchmark::State &state, std::string key, int w, int h, int count, uint32_t jobs)
@@ -324,21 +332,25 @@ int main(int argc, char **argv)
     benchmark::Initialize(&argc, argv);
     MedianReporter reporter;
     benchmark::RunSpecifiedBenchmarks(&reporter);
-    std::printf("\nmedian ms per frame and mean corner error (px)\n%-24s %10s %10s %10s %10s %8s\n", "case", "plano ms",
-                "plano px", "ECC ms", "ECC px", "ratio");
+    // The difference of the two errors is taken pair by pair (both saw the same noise), with
+    // the standard error of its mean.
+    std::printf("\nmedian ms per frame and mean corner error (px) over %d frame pairs\n%-24s %10s %10s %10s %10s %8s %22s\n",
+                kPairs, "case", "plano ms", "plano px", "ECC ms", "ECC px", "ratio", "px difference");
     for (const std::string &k : names) {
         auto ms = [&](const std::string &who) {
             auto it = g_ms.find(who + "/" + k + "/repeats:5");
             if (it == g_ms.end()) it = g_ms.find(who + "/" + k);
             return it == g_ms.end() ? 0.0 : it->second;
         };
-        auto px = [&](const std::string &who) {
-            auto it = g_error.find(who + "/" + k);
-            return it == g_error.end() ? 0.0 : it->second;
-        };
+        const std::vector<double> &a = g_errors["plano/" + k], &b = g_errors["ecc/" + k];
+        double d = 0, dd = 0;
+        const std::size_t n = std::min(a.size(), b.size());
+        for (std::size_t i = 0; i < n; ++i) d += a[i] - b[i], dd += (a[i] - b[i]) * (a[i] - b[i]);
+        const double md = n ? d / double(n) : 0.0;
+        const double se = n > 1 ? std::sqrt(std::max(0.0, dd / double(n) - md * md) / double(n - 1)) : 0.0;
         const double ours = ms("plano"), ecc = ms("ecc");
-        std::printf("%-24s %10.2f %10.5f %10.2f %10.5f %8.2f\n", k.c_str(), ours, px("plano"), ecc, px("ecc"),
-                    ecc > 0 ? ours / ecc : 0.0);
+        std::printf("%-24s %10.2f %10.5f %10.2f %10.5f %8.2f %+11.5f +- %7.5f\n", k.c_str(), ours, mean(a), ecc, mean(b),
+                    ecc > 0 ? ours / ecc : 0.0, md, se);
     }
     benchmark::Shutdown();
     return 0;
