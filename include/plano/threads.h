@@ -207,10 +207,13 @@ typedef struct SmoothingJob {
 PLANO_API Plx_Bool gbApplySmoothingToWindow(void *job);
 
 /* Gaussian smoothing with 2*trunc(4 sigma)+1 taps, along x into intermediate then along y
- * into dest, each pass split into the host's number of jobs: job 0 runs on the calling
- * thread while the others run on pooled workers (all jobs run on the calling thread when
- * host is null). Results are the same bits for any number of jobs. dest and intermediate are (re)formed with source's format, type and
- * size; dest null makes a new image, intermediate null a temporary one; dest may be source
+ * into dest, split into the host's number of jobs: job 0 runs on the calling thread while
+ * the others run on pooled workers (all jobs run on the calling thread when host is null).
+ * Float and double images take both directions in one pass over bands of rows, with the
+ * x-smoothed rows kept in cache (and still written to intermediate); the bits are those of
+ * two separate passes. Results are the same bits for any number of jobs. dest and
+ * intermediate are (re)formed with source's format, type and size; dest null makes a new
+ * image, intermediate null a temporary one; dest may be source
  * itself (in-place), but intermediate must share pixels with neither (code 7). Returns dest.
  * When a start or a wait fails, every job already started is still waited for before the
  * failure is returned, so no job outlives the images. An interrupt (slot 2) is not a failure:

@@ -279,6 +279,19 @@ inline void taps(Isa isa, A *out, const A *const *src, const A *k, uint32_t ntap
     taps_baseline<A, Sym>(out, src, k, ntaps, n);
 }
 
+// The same with the instruction set fixed at compile time, for loops that choose it once.
+template <class A, bool Sym, Isa I, bool Stream = false>
+[[gnu::always_inline]] inline void taps_run(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
+{
+#ifdef PLX_CONV_X86
+    if constexpr (I == Isa::avx2) {
+        taps_avx2<A, Sym, Stream>(out, src, k, ntaps, n);
+        return;
+    }
+#endif
+    taps_baseline<A, Sym>(out, src, k, ntaps, n);
+}
+
 }  // namespace plx::conv
 
 #endif

@@ -30,18 +30,7 @@ namespace {
 
 using plx::conv::Isa;
 using plx::conv::Lanes;
-
-template <class A, bool Sym, Isa I, bool Stream = false>
-PLX_INLINE void taps_run(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n)
-{
-#ifdef PLX_CONV_X86
-    if constexpr (I == Isa::avx2) {
-        plx::conv::taps_avx2<A, Sym, Stream>(out, src, k, ntaps, n);
-        return;
-    }
-#endif
-    plx::conv::taps_baseline<A, Sym>(out, src, k, ntaps, n);
-}
+using plx::conv::taps_run;
 
 // Scratch of one convolution call, carved from one heap block.
 template <class A>
