@@ -358,6 +358,14 @@ PLANO_API Plx_Bool bMatchImages(Track *track, int32_t iterations, double lambda,
         return PLX_FALSE;
     }
 
+    // Near the minimum the steps fall below what the single-precision residuals can tell
+    // apart, and every further step is rejected while the damping only grows. So once the
+    // last accepted step changed the cost by less than kSettled of it, kRejections rejected
+    // steps in a row end the level instead of running the iterations out.
+    constexpr double kSettled = 1e-3;
+    constexpr int kRejections = 3;
+    bool settled = false;
+    int rejected_in_row = 0;
     for (int32_t it = 0; it < iterations; ++it) {
         uint32_t accepted = 0;
         double reduction = 0.0;
@@ -370,9 +378,11 @@ PLANO_API Plx_Bool bMatchImages(Track *track, int32_t iterations, double lambda,
         bool stop;
         if (accepted) {
             stop = reduction < 0.01;
+            settled = reduction < kSettled * (lm.sumo->residual + reduction);  // of the cost before
+            rejected_in_row = 0;
             if (!stop) lambda *= lambda_factor;
         } else {
-            stop = lm.sumo->residual < 0.01;
+            stop = lm.sumo->residual < 0.01 || (settled && ++rejected_in_row >= kRejections);
             if (!stop) lambda /= lambda_factor;
         }
         if (host && status_time)

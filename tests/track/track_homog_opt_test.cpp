@@ -1191,6 +1191,26 @@ TEST(TrackHomogMatch, InterruptKeepsTheLevelsStartingMotion)
     EXPECT_EQ(region->observation_mask, nullptr);
 }
 
+// Once the cost cannot be told apart from its floor, a rejected step ends the level: the
+// iterations allowed are a limit, not a count. Progress advances once per iteration, 0.2 of
+// the track's status range at level 1 and 0.6 at level 0.
+TEST(TrackHomogMatch, ConvergedLevelEndsBeforeTheIterationLimit)
+{
+    HostPtr host(plano_host_new(1));
+    Frames f(mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1}));
+    std::mt19937 rng(3);
+    std::normal_distribution<float> noise(0.f, 0.02f);
+    for (int32_t r = 0; r < kSize; ++r)
+        for (int32_t c = 0; c < kSize; ++c) static_cast<float *>(plx_image_row(f.current.get(), r))[c] += noise(rng);
+    TrackPtr track = make_track(f, Settings{}, plano_host_interface(host.get()));
+    auto *region = static_cast<TrackRegion *>(track->regions->head->data);
+    StatusTime st{1e9, 0.0};
+    ASSERT_TRUE(bTrackHomogOptimise(track.get(), 200, 1e-3, 10.0, plano_host_interface(host.get()), &st));
+    EXPECT_LT(corner_error(region, mat33({1, 0, 1.3, 0, 1, -0.7, 0, 0, 1})), 0.1);
+    EXPECT_GT(st.done, 0.0);
+    EXPECT_LT(st.done, 20 * 0.8 * track->status_range);  // at most 20 iterations a level
+}
+
 // Two regions sharing a constraint point whose target is estimated: the estimate lands where
 // the true motion carries the point.
 TEST(TrackHomogMatch, EstimatesConstraintTarget)
