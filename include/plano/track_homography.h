@@ -42,9 +42,10 @@ extern "C" {
  *
  * The optional gradient images (both or neither; the search image's format, type and size)
  * give the image derivatives of the Jacobians: they are interpolated bilinearly at the warped
- * position like the values. The tracker fills them with bTrackSearchGradients. Without them
- * the derivatives are those of the bilinear interpolant itself, whose fixed point under noise
- * in the search image leans towards half-pixel positions. */
+ * position like the values. The tracker fills them with bTrackSearchGradients at its
+ * finest level; coarser levels keep the interpolant's derivatives for their pull-in. Without
+ * them the derivatives are those of the bilinear interpolant itself, whose fixed point under
+ * noise in the search image leans towards half-pixel positions. */
 typedef struct TrackPixelBlock {
     double zh;
     float zh_f;
