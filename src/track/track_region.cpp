@@ -184,6 +184,45 @@ enum OwnedSlot {
     kSmoothedReference
 };
 
+// The region window `box` of `image` (channel: 0 all, else the one extracted) smoothed with
+// the image around it, into buffer or a new image. Smoothing the window on its own would
+// repeat its edge pixels where the search window sees real surroundings, and the border
+// pixels of the two would no longer match. Only the image's own edges are repeated, as for
+// the search window. Null with the trace set on failure.
+Plx_Image *smooth_in_context(const ThreadHostInterface *host, const Plx_Image *image, Plx_Window box, uint32_t channel,
+                             double sigma, Plx_Image *buffer, Plx_Image *scratch)
+{
+    const int32_t m = int32_t(std::trunc(4.0 * sigma));  // the mask's radius
+    const int32_t x0 = std::max(0, box.x - m), y0 = std::max(0, box.y - m);
+    const int32_t x1 = int32_t(std::min<int64_t>(image->width, int64_t(box.x) + box.width + m));
+    const int32_t y1 = int32_t(std::min<int64_t>(image->height, int64_t(box.y) + box.height + m));
+    Plx_Image view{}, grey{}, smoothed{};
+    bool ok = plx_image_extract_q(image, Plx_Window{x0, y0, x1 - x0, y1 - y0}, PLX_FORMAT_NONE, PLX_TYPE_NONE, 0,
+                                  &view) != nullptr;
+    const Plx_Image *source = &view;
+    if (ok && channel != 0) {
+        ok = plx_image_extract_channel_q(&view, storage_index(image->format, channel), PLX_TYPE_NONE, &grey) !=
+             nullptr;
+        source = &grey;
+    }
+    ok = ok && pgiThreadedSmoothImage(host, source, &smoothed, sigma, scratch) != nullptr;
+    Plx_Image *out = nullptr;
+    if (ok) {
+        out = buffer != nullptr ? buffer : empty_image();
+        const Plx_Window inner{box.x - x0, box.y - y0, box.width, box.height};
+        if (out == nullptr ||
+            plx_image_extract_q(&smoothed, inner, PLX_FORMAT_NONE, PLX_TYPE_NONE, 1, out) == nullptr) {
+            if (out != buffer) plx_image_free(out);
+            out = nullptr;
+        }
+    }
+    plx_image_free(&view);
+    plx_image_free(&grey);
+    plx_image_free(&smoothed);
+    if (out == nullptr) PLX_ERR_PASS();
+    return out;
+}
+
 // A region under construction: released with everything it made unless handed over.
 struct RegionBuild {
     TrackRegion *region = nullptr;
@@ -549,6 +588,8 @@ PLANO_API TrackRegion *pTrackRegion(
     const bool shared_reference = reference_image == previous;
     const bool shared_search = previous == current;
     Plx_Image *rw = tw, *rm = tm;
+    uint32_t reference_channel = channel;
+    Plx_Window rbox = tbox;
     if (shared_reference) {
         region->template_origin[0] = region->region_origin[0];
         region->template_origin[1] = region->region_origin[1];
@@ -562,8 +603,7 @@ PLANO_API TrackRegion *pTrackRegion(
             return nullptr;
         }
         // The reference window is cut from the template's channel, so all windows compare.
-        uint32_t reference_channel = channel;
-        Plx_Window rbox;
+        reference_channel = channel;
         if (!bExtractRegion(reference_image, reference_mask, reference_camera, channel != 0 ? 1u : 0u,
                             &reference_channel, rw, rm, &rbox)) {
             PLX_ERR_PASS();
@@ -612,7 +652,13 @@ PLANO_API TrackRegion *pTrackRegion(
     // ---- pre-smoothing ----
     Plx_Image *t0 = tw, *r0 = rw, *s0 = sw;
     if (smoothing_sigma > 0.0) {
-        t0 = pgiThreadedSmoothImage(host, tw, smoothed_template_buffer, smoothing_sigma, smoothing_scratch);
+        // Region windows cut straight from their image are smoothed with the image around
+        // them (the search window reaches past the pixels the template maps to); windows
+        // resampled through a camera have no such surroundings and are smoothed alone.
+        t0 = plx_camera_is_linear(&track->previous_camera)
+                 ? smooth_in_context(host, previous, tbox, channel, smoothing_sigma, smoothed_template_buffer,
+                                     smoothing_scratch)
+                 : pgiThreadedSmoothImage(host, tw, smoothed_template_buffer, smoothing_sigma, smoothing_scratch);
         if (t0 != nullptr && smoothed_template_buffer == nullptr) region->owned_images[kSmoothedTemplate] = t0;
         if (t0 == nullptr) {
             PLX_ERR_PASS();
@@ -622,7 +668,10 @@ PLANO_API TrackRegion *pTrackRegion(
             r0 = t0;
         } else {
             r0 = region->owned_images[kSmoothedReference] =
-                pgiThreadedSmoothImage(host, rw, nullptr, smoothing_sigma, smoothing_scratch);
+                plx_camera_is_linear(reference_camera)
+                    ? smooth_in_context(host, reference_image, rbox, reference_channel, smoothing_sigma, nullptr,
+                                        smoothing_scratch)
+                    : pgiThreadedSmoothImage(host, rw, nullptr, smoothing_sigma, smoothing_scratch);
             if (r0 == nullptr) {
                 PLX_ERR_PASS();
                 return nullptr;

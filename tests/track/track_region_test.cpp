@@ -412,6 +412,15 @@ TEST(TrackRegion, SmoothingAndCallerStorageAreUsedAndNeverFreed)
         for (int32_t c = 0; c < expected->width; ++c)
             ASSERT_EQ(px(expected.get(), r, c), px(smoothed_window.get(), r, c));
     EXPECT_EQ(smoothed_window->x, 16);
+    // The template is smoothed with the frame around it, so its border pixels are those of
+    // the whole previous frame smoothed, not of its own edges repeated.
+    Image whole(pgiThreadedSmoothImage(nullptr, s->previous.get(), nullptr, 1.5, nullptr));
+    ASSERT_NE(whole, nullptr);
+    const int32_t tx = int32_t(region->template_position[0]), ty = int32_t(region->template_position[1]);
+    ASSERT_EQ(smoothed_template->width, 11);
+    for (int32_t r = 0; r < smoothed_template->height; ++r)
+        for (int32_t c = 0; c < smoothed_template->width; ++c)
+            ASSERT_EQ(px(whole.get(), ty + r, tx + c), px(smoothed_template.get(), r, c)) << r << "," << c;
     s.reset();
     // The storage no longer points at the region's windows; the caller's images live on.
     EXPECT_EQ(template_storage.level[0].image, nullptr);
