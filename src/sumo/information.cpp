@@ -303,7 +303,17 @@ bool build_scope(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t fir
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return false;
     }
-    if (!evaluate_split(sumo, scope, residual, first, last, first, last, host, function)) return false;
+    // The owners are the scope's states within [first, last]: the jobs split their indices,
+    // not the whole span of the limits (a last of "all" would leave every state to job 0).
+    uint32_t lo, hi;
+    if (scope.branch != nullptr)
+        bSumoGetIndexLimitsBranch(scope.branch, &lo, &hi);
+    else
+        bSumoGetIndexLimitsStateRange(scope.first, scope.last, &lo, &hi);
+    lo = std::max(lo, first);
+    hi = std::min(hi, last);
+    if (lo != kAll && lo <= hi && !evaluate_split(sumo, scope, residual, first, last, lo, hi, host, function))
+        return false;
     return !threaded(sumo, host) || combine_scope(scope, last, 0, sumo->n_threads);
 }
 
