@@ -292,6 +292,29 @@ template <class A, bool Sym, Isa I, bool Stream = false>
     taps_baseline<A, Sym>(out, src, k, ntaps, n);
 }
 
+// taps_run over any n: whole vectors in place, the ragged tail staged through one full
+// vector (zero-padded) so that every value gets the same arithmetic wherever it lies.
+// stage holds ntaps + 1 vectors, stage_src ntaps pointers.
+template <class A, bool Sym, Isa I, bool Stream = false>
+[[gnu::always_inline]] inline void taps_any(A *out, const A *const *src, const A *k, uint32_t ntaps, std::size_t n,
+                                            A *stage, const A **stage_src)
+{
+    constexpr std::size_t W = Lanes<A>::W;
+    const std::size_t whole = n - n % W;
+    if (whole != 0) taps_run<A, Sym, I, Stream>(out, src, k, ntaps, whole);
+    if (whole == n) return;
+    const std::size_t rest = n - whole;
+    for (uint32_t t = 0; t < ntaps; ++t) {
+        A *st = stage + std::size_t(t) * W;
+        std::memcpy(st, src[t] + whole, rest * sizeof(A));
+        for (std::size_t j = rest; j < W; ++j) st[j] = A(0);
+        stage_src[t] = st;
+    }
+    A *tail = stage + std::size_t(ntaps) * W;
+    taps_run<A, Sym, I>(tail, stage_src, k, ntaps, W);
+    std::memcpy(out + whole, tail, rest * sizeof(A));
+}
+
 }  // namespace plx::conv
 
 #endif

@@ -47,25 +47,11 @@ struct Scratch {
     uint32_t ring_rows;
 };
 
-// The kernel over any n: whole vectors in place, the tail staged through one full vector.
+// The kernel over any n with this call's scratch.
 template <class A, bool Sym, Isa I, bool Stream = false>
-PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n,
-                           const Scratch<A> &s)
+PLX_INLINE void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n, const Scratch<A> &s)
 {
-    constexpr std::size_t W = Lanes<A>::W;
-    const std::size_t whole = n - n % W;
-    taps_run<A, Sym, I, Stream>(out, src, s.k, ntaps, whole);
-    if (whole == n) return;
-    const std::size_t rest = n - whole;
-    for (uint32_t t = 0; t < ntaps; ++t) {
-        A *st = s.stage + std::size_t(t) * W;
-        std::memcpy(st, src[t] + whole, rest * sizeof(A));
-        for (std::size_t j = rest; j < W; ++j) st[j] = A(0);
-        s.stage_src[t] = st;
-    }
-    A *tail = s.stage + std::size_t(ntaps) * W;
-    taps_run<A, Sym, I>(tail, s.stage_src, s.k, ntaps, W);
-    std::memcpy(out + whole, tail, rest * sizeof(A));
+    plx::conv::taps_any<A, Sym, I, Stream>(out, src, s.k, ntaps, n, s.stage, s.stage_src);
 }
 
 // ---- pixel conversion ----

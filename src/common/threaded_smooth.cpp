@@ -137,25 +137,11 @@ struct FusedScratch {
     }
 };
 
-// The kernel over any n: whole vectors in place, the tail staged through one full vector
-// (zero-padded), so every value gets the same arithmetic wherever it lies.
+// The kernel over any n with this job's scratch.
 template <class A, bool Sym, Isa I, bool Stream = false>
 void apply_taps(A *out, const A *const *src, uint32_t ntaps, std::size_t n, const FusedScratch<A> &s)
 {
-    constexpr std::size_t W = Lanes<A>::W;
-    const std::size_t whole = n - n % W;
-    if (whole != 0) taps_run<A, Sym, I, Stream>(out, src, s.k, ntaps, whole);
-    if (whole == n) return;
-    const std::size_t rest = n - whole;
-    for (uint32_t t = 0; t < ntaps; ++t) {
-        A *st = s.stage + std::size_t(t) * W;
-        std::memcpy(st, src[t] + whole, rest * sizeof(A));
-        std::fill(st + rest, st + W, A(0));
-        s.stage_src[t] = st;
-    }
-    A *tail = s.stage + std::size_t(ntaps) * W;
-    taps_run<A, Sym, I>(tail, s.stage_src, s.k, ntaps, W);
-    std::memcpy(out + whole, tail, rest * sizeof(A));
+    plx::conv::taps_any<A, Sym, I, Stream>(out, src, s.k, ntaps, n, s.stage, s.stage_src);
 }
 
 // Values [a, a + count) of a row of n values, pixels of `lanes` values, with the end pixels
