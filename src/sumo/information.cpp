@@ -147,6 +147,22 @@ void gather_model(Sumo *sumo, uint32_t first, uint32_t last, bool add)
     walk_branch(sumo->root, visit);
 }
 
+// The index range of the observation owners: the scope's active states within [first, last]
+// (first kAll: no limit). False when there are none.
+bool owner_limits(const Scope &scope, uint32_t first, uint32_t last, uint32_t *lo, uint32_t *hi)
+{
+    if (scope.branch != nullptr)
+        bSumoGetIndexLimitsBranch(scope.branch, lo, hi);
+    else
+        bSumoGetIndexLimitsStateRange(scope.first, scope.last, lo, hi);
+    if (*lo == kAll) return false;
+    if (first != kAll) {
+        *lo = std::max(*lo, first);
+        *hi = std::min(*hi, last);
+    }
+    return *lo <= *hi;
+}
+
 // The entry points' evaluation of a branch or run: every observation the scope owns within
 // [first, last] (first kAll: all of them, with every Jacobian), added to the work copies.
 bool evaluate_entry(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last, const ThreadHostInterface *host,
@@ -156,18 +172,8 @@ bool evaluate_entry(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t las
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return false;
     }
-    // Owners: the scope's active states, within [first, last] when given.
     uint32_t lo, hi;
-    if (scope.branch != nullptr)
-        bSumoGetIndexLimitsBranch(scope.branch, &lo, &hi);
-    else
-        bSumoGetIndexLimitsStateRange(scope.first, scope.last, &lo, &hi);
-    if (lo == kAll) return true;
-    if (first != kAll) {
-        lo = std::max(lo, first);
-        hi = std::min(hi, last);
-        if (hi < lo) return true;
-    }
+    if (!owner_limits(scope, first, last, &lo, &hi)) return true;
     if (!threaded(sumo, host)) return evaluate_split(sumo, scope, 1, first, last, lo, hi, host, function);
     gather_model(sumo, first, last, false);
     if (!evaluate_split(sumo, scope, 1, first, last, lo, hi, host, function)) return false;
@@ -303,16 +309,11 @@ bool build_scope(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t fir
         plx_err_register_fileline(function, PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
         return false;
     }
-    // The owners are the scope's states within [first, last]: the jobs split their indices,
-    // not the whole span of the limits (a last of "all" would leave every state to job 0).
+    // The jobs split the owners' indices, not the whole span of the limits (a last of "all"
+    // would leave every state to job 0).
     uint32_t lo, hi;
-    if (scope.branch != nullptr)
-        bSumoGetIndexLimitsBranch(scope.branch, &lo, &hi);
-    else
-        bSumoGetIndexLimitsStateRange(scope.first, scope.last, &lo, &hi);
-    lo = std::max(lo, first);
-    hi = std::min(hi, last);
-    if (lo != kAll && lo <= hi && !evaluate_split(sumo, scope, residual, first, last, lo, hi, host, function))
+    if (owner_limits(scope, first, last, &lo, &hi) &&
+        !evaluate_split(sumo, scope, residual, first, last, lo, hi, host, function))
         return false;
     return !threaded(sumo, host) || combine_scope(scope, last, 0, sumo->n_threads);
 }
