@@ -193,13 +193,13 @@ public:
     // times the gain.
     void sample(uint32_t ch, float &S, float &dSx, float &dSy) const
     {
-        const float s00 = r0_[ch], s01 = r0_[step_ + ch];
-        const float s10 = r1_[ch], s11 = r1_[step_ + ch];
         S = interpolate(r0_, r1_, ch);
         if (grad_x_ != nullptr) {
             dSx = gain_ * interpolate(gx0_, gx1_, ch);
             dSy = gain_ * interpolate(gy0_, gy1_, ch);
         } else {
+            const float s00 = r0_[ch], s01 = r0_[step_ + ch];
+            const float s10 = r1_[ch], s11 = r1_[step_ + ch];
             dSx = gain_ * ((s01 - s00) * (1.f - fy_) + (s11 - s10) * fy_);
             dSy = gain_ * ((s10 - s00) * (1.f - fx_) + (s11 - s01) * fx_);
         }
