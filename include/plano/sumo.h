@@ -243,10 +243,12 @@ struct Sumo {
     Plx_Bool (*io_header_read)(void *file, uint32_t binary, void *arg);
     Plx_Bool (*io_header_write)(void *file, uint32_t binary, void *arg);
     void *io_header_arg;
-    /* Private: per-job workspaces kept between builds, and the last whole-model build. */
+    /* Private: per-job workspaces kept between builds, the last whole-model build, and the
+     * fused observation terms of a threaded build computed ahead of their accumulation. */
     SumoWorkspace *job_workspaces;
     uint32_t n_job_workspaces;
     void *build_cache;
+    void *fused_ahead;
 };
 
 /* ---- optimiser ---- */

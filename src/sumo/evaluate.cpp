@@ -199,44 +199,66 @@ FusedResult fused_chi2(FusedHKernel kernel, SumoObs *o, double *chi2, double *jt
     return r;
 }
 
+// The kernel's terms of a fused observation with Jacobians for [first, last]; declined when
+// the observation is too large for the fixed arrays.
+FusedResult fused_terms(FusedHKernel kernel, SumoObs *obs, uint32_t first, uint32_t last, FusedTerms *t)
+{
+    if (obs->n_states > 8) return FusedResult::declined;
+    t->n_total = 0;
+    t->any = false;
+    for (uint32_t i = 0; i < obs->n_states; ++i) {
+        SumoStateVector *s = obs->states[i];
+        t->offset[i] = t->n_total;
+        t->n_total += s != nullptr ? dim(s) : 0;
+        t->want[i] = s != nullptr && is_active(s) && dim(s) > 0 &&
+                     (first == kAll || (s->index >= first && s->index <= last));
+        t->any = t->any || t->want[i];
+    }
+    if (t->n_total > kFusedMaxParams) return FusedResult::declined;
+    t->chi2 = 0.0;
+    return fused_chi2(kernel, obs, &t->chi2, t->any ? t->jtnj : nullptr, t->jtnr);
+}
+
+// The terms computed ahead for this observation and these limits, or null.
+const FusedTerms *terms_ahead(const Sumo *sumo, const SumoObs *obs, uint32_t first, uint32_t last)
+{
+    const auto *ahead = static_cast<const FusedAhead *>(sumo->fused_ahead);
+    if (ahead == nullptr || ahead->first != first || ahead->last != last) return nullptr;
+    const auto it = ahead->index.find(obs);
+    return it != ahead->index.end() && ahead->done[it->second] ? &ahead->terms[it->second] : nullptr;
+}
+
 // accumulate_obs through a fused kernel: the same decisions, costs and destinations as the
 // general path, with the terms taken from the kernel's stacked J^T N J and J^T N r.
 FusedResult accumulate_fused(Sumo *sumo, FusedHKernel kernel, SumoObs *obs, uint32_t residual, uint32_t eliminate,
                              uint32_t add, uint32_t first, uint32_t last, uint32_t thread, double *cost)
 {
     constexpr FusedResult failed = FusedResult::failed;
-    uint32_t offset[8], n_total = 0;
-    bool want[8];
-    bool any = false;
-    if (obs->n_states > 8) return FusedResult::declined;
-    for (uint32_t i = 0; i < obs->n_states; ++i) {
-        SumoStateVector *s = obs->states[i];
-        offset[i] = n_total;
-        n_total += s != nullptr ? dim(s) : 0;
-        want[i] = s != nullptr && is_active(s) && dim(s) > 0 && (first == kAll || (s->index >= first && s->index <= last));
-        any = any || want[i];
+    FusedTerms local;
+    const FusedTerms *t = terms_ahead(sumo, obs, first, last);
+    if (t == nullptr) {
+        const FusedResult r = fused_terms(kernel, obs, first, last, &local);
+        if (r != FusedResult::done) return r;
+        t = &local;
     }
-    if (n_total > kFusedMaxParams) return FusedResult::declined;
-    double jtnj[kFusedMaxParams * kFusedMaxParams], jtnr[kFusedMaxParams];
-    double chi2 = 0.0;
-    const FusedResult r = fused_chi2(kernel, obs, &chi2, any ? jtnj : nullptr, jtnr);
-    if (r != FusedResult::done) return r;
     *cost = 0.0;
     if (residual) {
-        if (!std::isfinite(chi2)) {
+        if (!std::isfinite(t->chi2)) {
             PLX_ERR_START_AS("bSumoObsEvaluate", PLX_ERROR_OUTSIDE_RANGE, "residual is not finite", 0);
             return failed;
         }
-        if (is_robust(obs)) obs->outlier = chi2 > obs->chi2_cutoff ? 1u : 0u;
-        *cost = cost_of(obs, chi2);
+        if (is_robust(obs)) obs->outlier = t->chi2 > obs->chi2_cutoff ? 1u : 0u;
+        *cost = cost_of(obs, t->chi2);
     }
-    if (!any) return FusedResult::done;
+    if (!t->any) return FusedResult::done;
+    const uint32_t n_total = t->n_total;
+    const double *jtnj = t->jtnj, *jtnr = t->jtnr;
     double alpha = (add ? 1.0 : -1.0) * obs->weight;
     if (is_robust(obs) && obs->outlier) alpha *= 1.0 / obs->variance_scaling;
     for (uint32_t i = 0; i < obs->n_states; ++i) {
-        if (!want[i]) continue;
+        if (!t->want[i]) continue;
         SumoStateVector *s = obs->states[i];
-        const uint32_t n = dim(s), oi = offset[i];
+        const uint32_t n = dim(s), oi = t->offset[i];
         double *A, *b;
         info_target(s, eliminate, thread, &A, &b);
         for (uint32_t r = 0; r < n; ++r) {
@@ -246,12 +268,12 @@ FusedResult accumulate_fused(Sumo *sumo, FusedHKernel kernel, SumoObs *obs, uint
             if (residual) b[r] += alpha * jtnr[oi + r];
         }
         for (uint32_t j = i + 1; j < obs->n_states; ++j) {
-            if (!want[j]) continue;
+            if (!t->want[j]) continue;
             double *M;
             bool i_row;
             if (!offdiag_target(sumo, s, obs->states[j], eliminate, thread, &M, &i_row)) return failed;
             // The row state's rows of the stacked matrix, the column state's columns.
-            const uint32_t row = i_row ? oi : offset[j], col = i_row ? offset[j] : oi;
+            const uint32_t row = i_row ? oi : t->offset[j], col = i_row ? t->offset[j] : oi;
             const uint32_t rows = i_row ? n : dim(obs->states[j]), cols = i_row ? dim(obs->states[j]) : n;
             for (uint32_t r = 0; r < rows; ++r) {
                 const double *src = jtnj + std::size_t(row + r) * n_total + col;
@@ -266,6 +288,12 @@ FusedResult accumulate_fused(Sumo *sumo, FusedHKernel kernel, SumoObs *obs, uint
 }  // namespace
 
 namespace sumo {
+
+bool fused_terms_of(SumoObs *obs, uint32_t first, uint32_t last, FusedTerms *terms)
+{
+    const FusedHKernel kernel = obs->kind <= SUMO_OBS_F_ROBUST ? fused_kernel_of(obs) : nullptr;
+    return kernel != nullptr && fused_terms(kernel, obs, first, last, terms) == FusedResult::done;
+}
 
 bool register_fused_h(SumoHFunction h, FusedHKernel kernel)
 {

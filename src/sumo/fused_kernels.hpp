@@ -8,6 +8,8 @@
 #define PLANO_SRC_SUMO_FUSED_KERNELS_HPP
 
 #include <cstdint>
+#include <unordered_map>
+#include <vector>
 
 #include "plano/sumo.h"
 
@@ -32,6 +34,30 @@ using FusedHKernel = FusedResult (*)(SumoStateVector **states, uint32_t n_states
 bool register_fused_h(SumoHFunction h, FusedHKernel kernel);
 // The kernel paired with h, or null.
 FusedHKernel fused_h(SumoHFunction h);
+
+// One observation's kernel terms with Jacobians for a range of states: where each state's
+// rows start in the stacked matrices and whether they are wanted.
+struct FusedTerms {
+    double chi2;
+    uint32_t n_total;
+    bool any;
+    uint32_t offset[8];
+    bool want[8];
+    double jtnr[kFusedMaxParams];
+    double jtnj[kFusedMaxParams * kFusedMaxParams];
+};
+// Writes the terms when the observation has a kernel that takes it; false otherwise (also
+// on a kernel failure, which the evaluation then meets and reports itself).
+bool fused_terms_of(SumoObs *obs, uint32_t first, uint32_t last, FusedTerms *terms);
+
+// Terms computed ahead of a build for the Jacobian limits [first, last]; the evaluation
+// takes an observation's terms from here when done[i] is set (Sumo::fused_ahead).
+struct FusedAhead {
+    uint32_t first = 0, last = 0;
+    std::unordered_map<const SumoObs *, uint32_t> index;
+    std::vector<FusedTerms> terms;
+    std::vector<uint8_t> done;
+};
 
 }  // namespace sumo
 

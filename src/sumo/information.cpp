@@ -2,9 +2,11 @@
 // fixed prior, evaluate the observations (threaded through the host's pool), combine the
 // per-thread accumulators, and damp the diagonal.
 #include <algorithm>
+#include <new>
 #include <vector>
 
 #include "common/job_batch.hpp"
+#include "sumo/fused_kernels.hpp"
 #include "sumo/sumo_internal.hpp"
 
 using namespace sumo;
@@ -13,33 +15,30 @@ namespace {
 
 bool in_last(const SumoStateVector *s, uint32_t last) { return last == kAll || s->index <= last; }
 
-// A chunk of the counted observations for the root build; with `cost`, the chunk's cost is
-// summed as it goes (in list order, as the total cost sums it).
+// A run of whole cost chunks of the counted observations for the root build; with `cost`,
+// each chunk's cost is summed as it goes (as the total cost sums it).
 struct RootJob {
     Sumo *sumo;
     SumoWorkspace *ws;
-    SumoObs *const *obs;
-    uint32_t count;
+    SumoObs *const *obs;  // all the counted observations
+    uint32_t begin, end;  // the job's observations
     uint32_t thread;
     uint32_t residual;
-    bool cost;
-    double sum;
+    double *sums;         // with cost, one per chunk of the whole list; else null
 };
 
 Plx_Bool root_job(void *argument)
 {
     auto *job = static_cast<RootJob *>(argument);
-    double sum = 0.0;
-    for (uint32_t i = 0; i < job->count; ++i) {
-        prefetch_obs(job->obs, i, job->count);
+    for (uint32_t i = job->begin; i < job->end; ++i) {
+        prefetch_obs(job->obs + job->begin, i - job->begin, job->end - job->begin);
         double c;
         if (!accumulate_obs(job->sumo, job->ws, job->obs[i], job->residual, 0, 1, kAll, kAll, job->thread, &c)) {
             plx_err_register_fileline("bSumoObsEvaluate", PLX_ERROR_CALLEE, __FILE__, __LINE__, "", 0);
             return PLX_FALSE;
         }
-        if (job->cost) sum += c;
+        if (job->sums != nullptr) job->sums[i / kCostChunk] += c;
     }
-    job->sum = sum;
     return PLX_TRUE;
 }
 
@@ -79,6 +78,63 @@ bool run(const ThreadHostInterface *host, Plx_Bool (*fn)(void *), std::vector<Jo
 
 bool threaded(const Sumo *sumo, const ThreadHostInterface *host) { return host != nullptr && sumo->n_threads > 0; }
 
+// A slice of the observations whose fused terms are computed ahead.
+struct AheadJob {
+    FusedAhead *ahead;
+    SumoObs *const *obs;
+    uint32_t begin, end;
+};
+
+Plx_Bool ahead_job(void *argument)
+{
+    auto *job = static_cast<AheadJob *>(argument);
+    FusedAhead &a = *job->ahead;
+    for (uint32_t i = job->begin; i < job->end; ++i)
+        a.done[i] = fused_terms_of(job->obs[i], a.first, a.last, &a.terms[i]) ? 1 : 0;
+    return PLX_TRUE;
+}
+
+// One state may own nearly all the work: a tracked region's pixel blocks all belong to its
+// illumination state, and the owner split would leave them to one job. Their fused kernels,
+// the bulk of such work, are therefore run first over even slices of the observations, and the
+// owner jobs then only add the terms, in the same order as ever: the bits do not change. False
+// only when the jobs fail; `ahead` stays empty when there is nothing worth doing.
+bool fused_terms_ahead(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last, uint32_t own_first,
+                       uint32_t own_last, const ThreadHostInterface *host, const char *function, FusedAhead &ahead)
+{
+    std::vector<SumoObs *> obs;
+    uint64_t rows = 0;
+    const uint32_t T = sumo->n_threads;
+    try {
+        scope.walk([&](SumoStateVector *s) {
+            if (!is_active(s) || s->index < own_first || s->index > own_last) return true;
+            for (SumoObs *o = s->obs_active; o != nullptr; o = o->next_in_state[slot_of(o, s)]) {
+                if (o->kind > SUMO_OBS_F_ROBUST || fused_h(o->func.h) == nullptr || !obs_all_initialised(o) ||
+                    !obs_lowest_in_range(o, s, first))
+                    continue;
+                obs.push_back(o);
+                rows += o->z.v.rows;
+            }
+            return true;
+        });
+        if (obs.size() < 2 || host_for(host, rows / kRowsPerObs, kMinObsPerJob, T) == nullptr) return true;
+        ahead.terms.resize(obs.size());
+        ahead.done.assign(obs.size(), 0);
+        ahead.index.reserve(obs.size());
+        for (uint32_t i = 0; i < obs.size(); ++i) ahead.index.emplace(obs[i], i);
+    } catch (const std::bad_alloc &) {
+        ahead = FusedAhead{};  // the build goes on without
+        return true;
+    }
+    ahead.first = first;
+    ahead.last = last;
+    const uint64_t K = obs.size();
+    std::vector<AheadJob> jobs(T);
+    for (uint32_t j = 0; j < T; ++j)
+        jobs[j] = AheadJob{&ahead, obs.data(), uint32_t(K * j / T), uint32_t(K * (j + 1) / T)};
+    return run(host, ahead_job, jobs, function);
+}
+
 // Evaluates the observations of the scope owned by states with index in [own_first,
 // own_last], with Jacobians for [first, last]. Threaded, the owner range is cut into T
 // contiguous sub-ranges, job j taking own_first + floor(j L / T) .. own_first +
@@ -99,6 +155,13 @@ bool evaluate_split(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t 
     const uint32_t T = sumo->n_threads;
     SumoWorkspace *ws = job_workspaces(sumo, T);
     if (ws == nullptr) return false;
+    FusedAhead ahead;
+    if (!fused_terms_ahead(sumo, scope, first, last, own_first, own_last, host, function, ahead)) return false;
+    if (!ahead.terms.empty()) sumo->fused_ahead = &ahead;
+    struct Clear {
+        Sumo *sumo;
+        ~Clear() { sumo->fused_ahead = nullptr; }
+    } clear{sumo};
     const uint64_t L = uint64_t(own_last) - own_first + 1;
     std::vector<RangeJob> jobs(T);
     for (uint32_t j = 0; j < T; ++j) {
@@ -199,12 +262,23 @@ bool build_root(Sumo *sumo, uint32_t residual, const ThreadHostInterface *host, 
     SumoWorkspace *ws = job_workspaces(sumo, T == 0 ? 1 : T);
     if (ws == nullptr) return false;
     const bool with_cost = cost != nullptr && residual != 0;
-    const uint64_t K = counted.size();
+    const uint64_t K = counted.size(), chunks = (K + kCostChunk - 1) / kCostChunk;
+    std::vector<double> sums;
+    if (with_cost) {
+        try {
+            sums.assign(chunks, 0.0);
+        } catch (const std::bad_alloc &) {
+            PLX_ERR_START_AS(function, PLX_ERROR_MALLOC_FAILED, "cost chunks", 0);
+            return false;
+        }
+    }
+    // Jobs take whole chunks, so that each chunk's cost is summed by one job in list order.
     std::vector<RootJob> jobs(T == 0 ? 1 : T);
     for (uint32_t j = 0; j < jobs.size(); ++j) {
-        const uint64_t begin = K * j / jobs.size(), end = K * (j + 1) / jobs.size();
-        jobs[j] = RootJob{sumo,     job_ws(ws, j), counted.data() + begin, uint32_t(end - begin),
-                          T == 0 ? SUMO_NOT_IN_THREAD : j, residual, with_cost, 0.0};
+        const uint64_t begin = std::min(K, chunks * j / jobs.size() * kCostChunk);
+        const uint64_t end = std::min(K, chunks * (j + 1) / jobs.size() * kCostChunk);
+        jobs[j] = RootJob{sumo,           job_ws(ws, j), counted.data(), uint32_t(begin), uint32_t(end),
+                          T == 0 ? SUMO_NOT_IN_THREAD : j, residual, with_cost ? sums.data() : nullptr};
     }
     if (T == 0) {
         if (!root_job(&jobs[0])) {
@@ -212,12 +286,12 @@ bool build_root(Sumo *sumo, uint32_t residual, const ThreadHostInterface *host, 
             return false;
         }
     } else {
-        if (!run(host_for(host, K, kMinObsPerJob, T), root_job, jobs, function)) return false;
+        if (!run(host_for(host, obs_work(counted), kMinObsPerJob, T), root_job, jobs, function)) return false;
         if (!combine_scope(all, kAll, 0, T)) return false;
     }
     if (with_cost) {
         double sum = 0.0;
-        for (const RootJob &job : jobs) sum += job.sum;
+        for (const double c : sums) sum += c;
         *cost = sum;
     }
     return true;

@@ -1,5 +1,7 @@
 // Total costs: of the whole model (threaded by chunks of the observation lists), of a
 // branch, a run of states or one state.
+#include <algorithm>
+#include <new>
 #include <vector>
 
 #include "common/job_batch.hpp"
@@ -12,45 +14,27 @@ namespace {
 struct CostJob {
     Sumo *sumo;
     SumoWorkspace *ws;
-    SumoObs *const *active;  // the job's chunk of the counted active observations
-    uint32_t n_active;
-    SumoObs *const *eliminated;  // and of the eliminated ones
-    uint32_t n_eliminated;
-    double sum;
+    const std::vector<SumoObs *> *obs;  // the counted observations, active then eliminated
+    uint32_t chunk_begin, chunk_end;    // the job's chunks
+    double *sums;                       // one per chunk
 };
-
-double chunk_cost(Sumo *sumo, SumoWorkspace *ws, SumoObs *const *obs, uint32_t count)
-{
-    double sum = 0.0;
-    for (uint32_t i = 0; i < count; ++i) {
-        prefetch_obs(obs, i, count);
-        const double c = obs_cost(sumo, ws, obs[i], "dSumoComputeResidual");
-        if (c == SUMO_FAILED_RESIDUAL) return c;
-        sum += c;
-    }
-    return sum;
-}
 
 Plx_Bool cost_job(void *argument)
 {
     auto *job = static_cast<CostJob *>(argument);
-    const double a = chunk_cost(job->sumo, job->ws, job->active, job->n_active);
-    const double e = a == SUMO_FAILED_RESIDUAL ? a : chunk_cost(job->sumo, job->ws, job->eliminated, job->n_eliminated);
-    job->sum = e == SUMO_FAILED_RESIDUAL ? e : a + e;
-    return job->sum == SUMO_FAILED_RESIDUAL ? PLX_FALSE : PLX_TRUE;
-}
-
-// T consecutive chunks of the counted observations: chunk j holds those numbered [jK/T,
-// (j+1)K/T).
-void chunk_list(const std::vector<SumoObs *> &counted, uint32_t T, std::vector<SumoObs *const *> &start,
-                std::vector<uint32_t> &count)
-{
-    const uint64_t K = counted.size();
-    for (uint32_t j = 0; j < T; ++j) {
-        const uint64_t begin = K * j / T, end = K * (j + 1) / T;
-        start[j] = counted.data() + begin;
-        count[j] = uint32_t(end - begin);
+    const std::vector<SumoObs *> &obs = *job->obs;
+    for (uint32_t k = job->chunk_begin; k < job->chunk_end; ++k) {
+        const uint32_t begin = k * kCostChunk, count = uint32_t(std::min<std::size_t>(kCostChunk, obs.size() - begin));
+        double sum = 0.0;
+        for (uint32_t i = 0; i < count; ++i) {
+            prefetch_obs(obs.data() + begin, i, count);
+            const double c = obs_cost(job->sumo, job->ws, obs[begin + i], "dSumoComputeResidual");
+            if (c == SUMO_FAILED_RESIDUAL) return PLX_FALSE;
+            sum += c;
+        }
+        job->sums[k] = sum;
     }
+    return PLX_TRUE;
 }
 
 }  // namespace
@@ -96,29 +80,35 @@ PLANO_API double dSumoComputeResidual(Sumo *sumo, uint32_t include_eliminated, c
     const uint32_t T = sumo->n_threads == 0 ? 1 : sumo->n_threads;
     SumoWorkspace *ws = job_workspaces(sumo, T);
     if (ws == nullptr) return SUMO_FAILED_RESIDUAL;
-    std::vector<SumoObs *> active, eliminated;
-    if (!collect_counted(sumo, sumo->obs_active, false, active) ||
+    std::vector<SumoObs *> obs, eliminated;
+    if (!collect_counted(sumo, sumo->obs_active, false, obs) ||
         (include_eliminated && !collect_counted(sumo, sumo->obs_eliminated, false, eliminated))) {
         PLX_ERR_PASS();
         return SUMO_FAILED_RESIDUAL;
     }
-    std::vector<SumoObs *const *> a_start(T), e_start(T);
-    std::vector<uint32_t> a_count(T), e_count(T, 0);
-    chunk_list(active, T, a_start, a_count);
-    chunk_list(eliminated, T, e_start, e_count);
+    std::vector<double> sums;
+    try {
+        obs.insert(obs.end(), eliminated.begin(), eliminated.end());
+        sums.assign((obs.size() + kCostChunk - 1) / kCostChunk, 0.0);
+    } catch (const std::bad_alloc &) {
+        PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "cost chunks", 0);
+        return SUMO_FAILED_RESIDUAL;
+    }
+    const uint64_t chunks = sums.size();
     std::vector<CostJob> jobs(T);
     for (uint32_t j = 0; j < T; ++j)
-        jobs[j] = CostJob{sumo, job_ws(ws, j), a_start[j], a_count[j], e_start[j], e_count[j], 0.0};
+        jobs[j] = CostJob{sumo,       job_ws(ws, j), &obs, uint32_t(chunks * j / T), uint32_t(chunks * (j + 1) / T),
+                          sums.data()};
     std::vector<ThreadedWorker *> workers(T, nullptr);
     const ThreadHostInterface *run_on =
-        sumo->n_threads == 0 ? nullptr : host_for(host, active.size() + eliminated.size(), kMinObsPerJob, T);
+        sumo->n_threads == 0 ? nullptr : host_for(host, obs_work(obs), kMinObsPerJob, T);
     const plano::JobsResult r = plano::run_jobs(run_on, cost_job, jobs.data(), sizeof(CostJob), T, workers.data());
     if (r != plano::JobsResult::ok) {
         PLX_ERR_PASS_MSG(plano::jobs_failure_message(r), 0);
         return SUMO_FAILED_RESIDUAL;
     }
     double sum = 0.0;
-    for (const CostJob &job : jobs) sum += job.sum;
+    for (const double c : sums) sum += c;
     return sum;
 }
 

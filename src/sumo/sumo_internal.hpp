@@ -6,6 +6,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <algorithm>
 #include <cstring>
 #include <vector>
 
@@ -250,6 +251,20 @@ void build_cache_drop(Sumo *sumo);
 // accumulators, so the results are the same bits either way.
 constexpr uint64_t kMinObsPerJob = 64;
 constexpr uint64_t kMinStatesPerJob = 256;
+// Where observations may be large (image blocks of thousands of rows), this many rows count
+// as one observation's worth of work.
+constexpr uint64_t kRowsPerObs = 16;
+// The work of a whole-model pass in observation units: their count, or their rows when those
+// weigh more.
+inline uint64_t obs_work(const std::vector<SumoObs *> &obs)
+{
+    uint64_t rows = 0;
+    for (const SumoObs *o : obs) rows += o->z.v.rows;
+    return std::max<uint64_t>(obs.size(), rows / kRowsPerObs);
+}
+// Total costs add the observations in fixed chunks of this many, each chunk in list order and
+// the chunk sums in chunk order, so that a cost has the same bits whatever the number of jobs.
+constexpr uint32_t kCostChunk = 32;
 inline const ThreadHostInterface *host_for(const ThreadHostInterface *host, uint64_t work, uint64_t min_per_job,
                                            uint32_t jobs)
 {

@@ -494,6 +494,22 @@ TEST(SumoSolver, CostCachedByTheIterationIsTheTotalCost)
                 EXPECT_EQ(after, before) << jobs << " jobs";
         }
     }
+    // Thousands of observations, split between real workers: the cost, whether summed on its
+    // own or taken from the build, has one set of bits whatever the job count.
+    double reference = 0.0;
+    for (uint32_t jobs : {0u, 1u, 2u, 5u}) {
+        HostPtr host(jobs ? plano_host_new(jobs) : nullptr);
+        const ThreadHostInterface *iface = jobs ? plano_host_interface(host.get()) : nullptr;
+        LineFit fit(false, iface, 3001);
+        const double cost = dSumoComputeResidual(fit.sumo.get(), 0, iface);
+        if (jobs == 0) reference = cost;
+        EXPECT_EQ(cost, reference) << jobs << " jobs";
+        fit.sumo->modified = 1;
+        uint32_t accepted = 0;
+        ASSERT_TRUE(iterate(fit.sumo.get(), 1e-3, &accepted, nullptr, iface));
+        EXPECT_EQ(accepted, 1u);
+        EXPECT_EQ(fit.sumo->residual, dSumoComputeResidual(fit.sumo.get(), 0, iface)) << jobs << " jobs";
+    }
     vThreadedWorkerPoolFree();
 }
 
