@@ -2,12 +2,14 @@
 // the threaded form, interrupts and progress.
 #include <atomic>
 
+#include "failure_check.hpp"
 #include "plano_host/host.h"
 #include "warp_test_util.hpp"
 
 namespace {
 
 using namespace warp_test;
+using plano_test::fails_with;
 
 TEST(ProjectiveWarpCombine, KindsAndMatrices)
 {
@@ -45,8 +47,7 @@ TEST(ProjectiveWarpCombine, KindsAndMatrices)
         for (int c = 0; c < 3; ++c) EXPECT_NEAR(prod.m[r][c] / prod.m[2][2], r == c ? 1.0 : 0.0, 1e-4);
 
     const Plx_Matrix33 zero = matrix(0, 0, 0, 0, 0, 0, 0, 0, 0);
-    EXPECT_FALSE(bCombineHomogCameras(&a, &zero, &b, &m, &mi, &kind, &identity));
-    EXPECT_EQ(last_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_TRUE(fails_with(bCombineHomogCameras(&a, &zero, &b, &m, &mi, &kind, &identity), PLX_ERROR_DIVISION_BY_ZERO));
 }
 
 TEST(ProjectiveWarpPixel, SingleSamplesAndTheirFailures)
@@ -88,8 +89,8 @@ TEST(ProjectiveWarpPixel, SingleSamplesAndTheirFailures)
     EXPECT_FALSE(bImagePixelProjectiveWarp(1.5, 1.5, bits.get(), nullptr, nullptr, nullptr, nullptr, v, &code));
     EXPECT_EQ(code, PLX_ERROR_ILLEGAL_PIXEL_TYPE);
     EXPECT_EQ(plx_err_get_error_count(), 0u);
-    EXPECT_FALSE(bImagePixelProjectiveWarp(1.5, 1.5, bits.get(), nullptr, nullptr, nullptr, nullptr, v, nullptr));
-    EXPECT_EQ(last_code(), PLX_ERROR_ILLEGAL_PIXEL_TYPE);
+    EXPECT_TRUE(fails_with(bImagePixelProjectiveWarp(1.5, 1.5, bits.get(), nullptr, nullptr, nullptr, nullptr, v, nullptr),
+                           PLX_ERROR_ILLEGAL_PIXEL_TYPE));
 }
 
 TEST(ProjectiveWarpFlow, HomographyBecomesDisplacements)
@@ -111,8 +112,7 @@ TEST(ProjectiveWarpFlow, HomographyBecomesDisplacements)
     const Plx_Image before = flow;
     Image one = make_bits(1, 1, true, 3, 4);
     const Plx_Matrix33 at_infinity = matrix(1, 0, 0, 0, 1, 0, 1, -1, 1);
-    EXPECT_FALSE(bHomogToFlow(one.get(), nullptr, &at_infinity, nullptr, &flow));
-    EXPECT_EQ(last_code(), PLX_ERROR_DIVISION_BY_ZERO);
+    EXPECT_TRUE(fails_with(bHomogToFlow(one.get(), nullptr, &at_infinity, nullptr, &flow), PLX_ERROR_DIVISION_BY_ZERO));
     EXPECT_EQ(flow.data, before.data);
     EXPECT_EQ(pixel(&flow, 1, 1), (std::vector<double>{3.5, 4.5}));
     plx_image_free(&flow);
@@ -129,46 +129,43 @@ TEST(ProjectiveWarpFailures, BadInputIsRefusedBeforeTheOutputIsTouched)
     Image valid = make_bits(8, 8, true);
     const Image out0 = copy(out.get()), valid0 = copy(valid.get());
     const Plx_Matrix33 I = translation(0, 0);
-    auto expect_refused = [&](const Plx_Image *source, const Plx_Matrix33 *H, const ProjectiveWarpParams *p, int32_t code,
-                              Plx_Image *output) {
-        EXPECT_FALSE(warp(source, output, H, p, valid.get()));
-        EXPECT_EQ(last_code(), code);
-        EXPECT_TRUE(same_pixels(out.get(), out0.get()));
-        EXPECT_TRUE(same_pixels(valid.get(), valid0.get()));
-    };
     Image field = make(PLX_FORMAT_VECTOR2D, PLX_TYPE_FLOAT, 8, 8);
-    expect_refused(field.get(), &I, nullptr, PLX_ERROR_ILLEGAL_FORMAT, out.get());
     Image ptrs(plx_image_form_gen_p(nullptr, 8, 8));
-    expect_refused(ptrs.get(), &I, nullptr, PLX_ERROR_ILLEGAL_FORMAT, out.get());
-    Image out_field = make(PLX_FORMAT_VECTOR2D, PLX_TYPE_FLOAT, 8, 8);
-    EXPECT_FALSE(warp(src.get(), out_field.get(), &I));
-    EXPECT_EQ(last_code(), PLX_ERROR_ILLEGAL_FORMAT);
-
-    ProjectiveWarpParams p;
-    vInitProjectiveWarpParams(&p);
-    WarpColourCorrection bad{3, {}};
-    p.colour_correction = &bad;
-    expect_refused(src.get(), &I, &p, PLX_ERROR_ILLEGAL_TYPE, out.get());
-
-    vInitProjectiveWarpParams(&p);
     Image disp8 = make(PLX_FORMAT_VECTOR2D, PLX_TYPE_UCHAR, 8, 8);
-    p.displacement = disp8.get();
-    expect_refused(src.get(), &I, &p, PLX_ERROR_ILLEGAL_PIXEL_TYPE, out.get());
-
-    vInitProjectiveWarpParams(&p);
-    p.fast_render = 1;
-    p.displacement = field.get();
-    expect_refused(src.get(), &I, &p, PLX_ERROR_UNSUPPORTED, out.get());
-    WarpColourCorrection gain{0, {1.0, 0.0}};
-    p.displacement = nullptr;
-    p.colour_correction = &gain;
-    expect_refused(src.get(), &I, &p, PLX_ERROR_UNSUPPORTED, out.get());
-
+    WarpColourCorrection bad{3, {}}, gain{0, {1.0, 0.0}};
     // Singular mappings: rows 0 and 1 dependent, affine and projective.
     const Plx_Matrix33 flat_affine = matrix(1, 2, 3, 2, 4, 6, 0, 0, 1);
     const Plx_Matrix33 flat_projective = matrix(1, 2, 3, 2, 4, 6, 0.5, 0, 1);
-    expect_refused(src.get(), &flat_affine, nullptr, PLX_ERROR_DIVISION_BY_ZERO, out.get());
-    expect_refused(src.get(), &flat_projective, nullptr, PLX_ERROR_DIVISION_BY_ZERO, out.get());
+    const struct {
+        const Plx_Image *source;
+        const Plx_Matrix33 *H;
+        const WarpColourCorrection *colour;
+        const Plx_Image *displacement;
+        uint32_t fast_render;
+        int32_t code;
+    } cases[] = {
+        {field.get(), &I, nullptr, nullptr, 0, PLX_ERROR_ILLEGAL_FORMAT},
+        {ptrs.get(), &I, nullptr, nullptr, 0, PLX_ERROR_ILLEGAL_FORMAT},
+        {src.get(), &I, &bad, nullptr, 0, PLX_ERROR_ILLEGAL_TYPE},
+        {src.get(), &I, nullptr, disp8.get(), 0, PLX_ERROR_ILLEGAL_PIXEL_TYPE},
+        {src.get(), &I, nullptr, field.get(), 1, PLX_ERROR_UNSUPPORTED},
+        {src.get(), &I, &gain, nullptr, 1, PLX_ERROR_UNSUPPORTED},
+        {src.get(), &flat_affine, nullptr, nullptr, 0, PLX_ERROR_DIVISION_BY_ZERO},
+        {src.get(), &flat_projective, nullptr, nullptr, 0, PLX_ERROR_DIVISION_BY_ZERO},
+    };
+    for (const auto &c : cases) {
+        SCOPED_TRACE(&c - cases);
+        ProjectiveWarpParams p;
+        vInitProjectiveWarpParams(&p);
+        p.colour_correction = c.colour;
+        p.displacement = c.displacement;
+        p.fast_render = c.fast_render;
+        EXPECT_TRUE(fails_with(warp(c.source, out.get(), c.H, &p, valid.get()), c.code));
+        EXPECT_TRUE(same_pixels(out.get(), out0.get()));
+        EXPECT_TRUE(same_pixels(valid.get(), valid0.get()));
+    }
+    Image out_field = make(PLX_FORMAT_VECTOR2D, PLX_TYPE_FLOAT, 8, 8);
+    EXPECT_TRUE(fails_with(warp(src.get(), out_field.get(), &I), PLX_ERROR_ILLEGAL_FORMAT));
 
     // An empty source is no work at all.
     Image empty = make(PLX_FORMAT_RGB, PLX_TYPE_UCHAR, 8, 0);

@@ -10,17 +10,12 @@
 #include <string>
 #include <vector>
 
-#include <unistd.h>
-
+#include "failure_check.hpp"
 #include "pellux/pellux.h"
 
 namespace {
 
-int32_t origin_code()
-{
-    Plx_ErrorRecord r;
-    return plx_err_get_error(0, &r) ? r.code : 0;
-}
+using plano_test::fails_with;
 
 std::vector<unsigned char> bytes_of(FILE *f)
 {
@@ -126,36 +121,26 @@ TEST(FileIO, ShortFilesFailedWritesAndNullArguments)
         std::vector<unsigned char> bytes(4 * (count - 1), 0x11);
         FILE *f = file_with(bytes);
         std::vector<uint32_t> out(count, 7u);
-        EXPECT_FALSE(plx_fread_lendian_ui32(f, out.data(), count));
-        EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+        EXPECT_TRUE(fails_with(plx_fread_lendian_ui32(f, out.data(), count), PLX_ERROR_CORRUPTED_FILE));
         EXPECT_EQ(out, std::vector<uint32_t>(count, 7u));
         std::fclose(f);
     }
     FILE *empty = file_with({});
     uint16_t s = 9;
-    EXPECT_FALSE(plx_fread_lendian_ui16(empty, &s, 1));
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_fread_lendian_ui16(empty, &s, 1), PLX_ERROR_CORRUPTED_FILE));
     EXPECT_EQ(s, 9);
     std::fclose(empty);
 
     // A stream open for reading only refuses writes.
-    char path[] = "/tmp/plx_fileio_XXXXXX";
-    int fd = mkstemp(path);
-    ASSERT_GE(fd, 0);
-    close(fd);
-    FILE *ro = std::fopen(path, "rb");
+    FILE *ro = std::fopen("/dev/null", "rb");
     ASSERT_NE(ro, nullptr);
     const double one = 1.0;
-    EXPECT_FALSE(plx_fwrite_lendian_f64(ro, &one, 1));
-    EXPECT_EQ(origin_code(), PLX_ERROR_WRITING_FILE);
+    EXPECT_TRUE(fails_with(plx_fwrite_lendian_f64(ro, &one, 1), PLX_ERROR_WRITING_FILE));
     std::fclose(ro);
-    std::remove(path);
 
-    EXPECT_FALSE(plx_fwrite_lendian_i16(nullptr, nullptr, 0));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    EXPECT_TRUE(fails_with(plx_fwrite_lendian_i16(nullptr, nullptr, 0), PLX_ERROR_ILLEGAL_ARGUMENT));
     FILE *f = std::tmpfile();
-    EXPECT_FALSE(plx_fread_lendian_f64(f, nullptr, 3));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    EXPECT_TRUE(fails_with(plx_fread_lendian_f64(f, nullptr, 3), PLX_ERROR_ILLEGAL_ARGUMENT));
     std::fclose(f);
 }
 
@@ -233,7 +218,6 @@ TEST(FileIO, BinaryBlocksRoundTripWithTheirMagicNumbers)
     EXPECT_EQ(std::memcmp(rx.data, x.data, 3 * sizeof(double)), 0);
     Plx_Matrix *rM = plx_mat_fread(f, nullptr, 0x168EFC80u);
     ASSERT_NE(rM, nullptr);
-    EXPECT_EQ(rM->owned, 1u);
     ASSERT_EQ(rM->rows, 2u);
     ASSERT_EQ(rM->cols, 3u);
     EXPECT_EQ(std::memcmp(rM->data, M.data, 6 * sizeof(double)), 0);
@@ -253,8 +237,7 @@ TEST(FileIO, BinaryBlocksRoundTripWithTheirMagicNumbers)
     Plx_Vector untouched;
     std::memset(&untouched, 0xAB, sizeof untouched);
     Plx_Vector copy = untouched;
-    EXPECT_EQ(plx_vec_fread(f, &untouched, 0x57CA10B3u), nullptr);
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_vec_fread(f, &untouched, 0x57CA10B3u), PLX_ERROR_CORRUPTED_FILE));
     EXPECT_EQ(std::memcmp(&untouched, &copy, sizeof copy), 0);
     std::fclose(f);
 
@@ -264,15 +247,13 @@ TEST(FileIO, BinaryBlocksRoundTripWithTheirMagicNumbers)
     cut.resize(cut.size() - 1);
     std::fclose(f);
     f = file_with(cut);
-    EXPECT_EQ(plx_mat_fread(f, nullptr, 1u), nullptr);
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_mat_fread(f, nullptr, 1u), PLX_ERROR_CORRUPTED_FILE));
     std::fclose(f);
 
     Plx_SquMatrix bad{};
     bad.type = PLX_SQUMAT_NONE;
     f = std::tmpfile();
-    EXPECT_FALSE(plx_squmat_fwrite(f, &bad, 1u));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_TYPE);
+    EXPECT_TRUE(fails_with(plx_squmat_fwrite(f, &bad, 1u), PLX_ERROR_ILLEGAL_TYPE));
     std::fclose(f);
     plx_mat_free(&M);
     plx_vec_free(&x);
@@ -325,21 +306,17 @@ TEST(FileIO, TextBlocksPrintReadablyAndScanBack)
 
     // A different name, a different kind of block, or a missing value is malformed.
     std::rewind(f);
-    EXPECT_EQ(plx_vec_fscanf(f, nullptr, "b"), nullptr);
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_vec_fscanf(f, nullptr, "b"), PLX_ERROR_CORRUPTED_FILE));
     std::rewind(f);
-    EXPECT_EQ(plx_mat_fscanf(f, nullptr, "x"), nullptr);
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_mat_fscanf(f, nullptr, "x"), PLX_ERROR_CORRUPTED_FILE));
     std::fclose(f);
     const char cut[] = "x (vector 3):\n  1 2\n";
     f = file_with(std::vector<unsigned char>(cut, cut + sizeof cut - 1));
-    EXPECT_EQ(plx_vec_fscanf(f, nullptr, "x"), nullptr);
-    EXPECT_EQ(origin_code(), PLX_ERROR_CORRUPTED_FILE);
+    EXPECT_TRUE(fails_with(plx_vec_fscanf(f, nullptr, "x"), PLX_ERROR_CORRUPTED_FILE));
     std::fclose(f);
 
     f = std::tmpfile();
-    EXPECT_FALSE(plx_vec_fprint(f, &x, "two words", 0));
-    EXPECT_EQ(origin_code(), PLX_ERROR_ILLEGAL_ARGUMENT);
+    EXPECT_TRUE(fails_with(plx_vec_fprint(f, &x, "two words", 0), PLX_ERROR_ILLEGAL_ARGUMENT));
     std::fclose(f);
     plx_mat_free(&M);
     plx_vec_free(&x);
