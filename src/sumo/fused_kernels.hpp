@@ -58,6 +58,20 @@ struct FusedAhead {
     std::vector<FusedTerms> terms;
     std::vector<uint8_t> done;
 };
+// With a threaded host and enough rows, computes the terms of the candidates that have a
+// kernel, over all jobs, into `ahead` and hands it to the optimiser (Sumo::fused_ahead) for
+// the evaluation that follows at the same parameters. False only when the jobs fail.
+bool terms_ahead_of(Sumo *sumo, const std::vector<SumoObs *> &candidates, uint32_t first, uint32_t last,
+                    const ThreadHostInterface *host, const char *function, FusedAhead &ahead);
+// Takes the terms back from the optimiser when it goes out of scope; declared after the
+// table, so that the optimiser lets go of it first.
+struct AheadInUse {
+    Sumo *sumo;
+    explicit AheadInUse(Sumo *s) : sumo(s) {}
+    ~AheadInUse() { sumo->fused_ahead = nullptr; }
+    AheadInUse(const AheadInUse &) = delete;
+    AheadInUse &operator=(const AheadInUse &) = delete;
+};
 
 }  // namespace sumo
 

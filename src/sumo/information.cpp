@@ -97,42 +97,22 @@ Plx_Bool ahead_job(void *argument)
 // One state may own nearly all the work: a tracked region's pixel blocks all belong to its
 // illumination state, and the owner split would leave them to one job. Their fused kernels,
 // the bulk of such work, are therefore run first over even slices of the observations, and the
-// owner jobs then only add the terms, in the same order as ever: the bits do not change. False
-// only when the jobs fail; `ahead` stays empty when there is nothing worth doing.
+// owner jobs then only add the terms, in the same order as ever: the bits do not change.
 bool fused_terms_ahead(Sumo *sumo, const Scope &scope, uint32_t first, uint32_t last, uint32_t own_first,
                        uint32_t own_last, const ThreadHostInterface *host, const char *function, FusedAhead &ahead)
 {
     std::vector<SumoObs *> obs;
-    uint64_t rows = 0;
-    const uint32_t T = sumo->n_threads;
     try {
         scope.walk([&](SumoStateVector *s) {
             if (!is_active(s) || s->index < own_first || s->index > own_last) return true;
-            for (SumoObs *o = s->obs_active; o != nullptr; o = o->next_in_state[slot_of(o, s)]) {
-                if (o->kind > SUMO_OBS_F_ROBUST || fused_h(o->func.h) == nullptr || !obs_all_initialised(o) ||
-                    !obs_lowest_in_range(o, s, first))
-                    continue;
-                obs.push_back(o);
-                rows += o->z.v.rows;
-            }
+            for (SumoObs *o = s->obs_active; o != nullptr; o = o->next_in_state[slot_of(o, s)])
+                if (obs_lowest_in_range(o, s, first)) obs.push_back(o);
             return true;
         });
-        if (obs.size() < 2 || host_for(host, rows / kRowsPerObs, kMinObsPerJob, T) == nullptr) return true;
-        ahead.terms.resize(obs.size());
-        ahead.done.assign(obs.size(), 0);
-        ahead.index.reserve(obs.size());
-        for (uint32_t i = 0; i < obs.size(); ++i) ahead.index.emplace(obs[i], i);
     } catch (const std::bad_alloc &) {
-        ahead = FusedAhead{};  // the build goes on without
-        return true;
+        return true;  // the build goes on without
     }
-    ahead.first = first;
-    ahead.last = last;
-    const uint64_t K = obs.size();
-    std::vector<AheadJob> jobs(T);
-    for (uint32_t j = 0; j < T; ++j)
-        jobs[j] = AheadJob{&ahead, obs.data(), uint32_t(K * j / T), uint32_t(K * (j + 1) / T)};
-    return run(host, ahead_job, jobs, function);
+    return terms_ahead_of(sumo, obs, first, last, host, function, ahead);
 }
 
 // Evaluates the observations of the scope owned by states with index in [own_first,
@@ -156,12 +136,8 @@ bool evaluate_split(Sumo *sumo, const Scope &scope, uint32_t residual, uint32_t 
     SumoWorkspace *ws = job_workspaces(sumo, T);
     if (ws == nullptr) return false;
     FusedAhead ahead;
+    const AheadInUse in_use(sumo);
     if (!fused_terms_ahead(sumo, scope, first, last, own_first, own_last, host, function, ahead)) return false;
-    if (!ahead.terms.empty()) sumo->fused_ahead = &ahead;
-    struct Clear {
-        Sumo *sumo;
-        ~Clear() { sumo->fused_ahead = nullptr; }
-    } clear{sumo};
     const uint64_t L = uint64_t(own_last) - own_first + 1;
     std::vector<RangeJob> jobs(T);
     for (uint32_t j = 0; j < T; ++j) {
@@ -300,6 +276,39 @@ bool build_root(Sumo *sumo, uint32_t residual, const ThreadHostInterface *host, 
 }  // namespace
 
 namespace sumo {
+
+bool terms_ahead_of(Sumo *sumo, const std::vector<SumoObs *> &candidates, uint32_t first, uint32_t last,
+                    const ThreadHostInterface *host, const char *function, FusedAhead &ahead)
+{
+    const uint32_t T = sumo->n_threads;
+    if (host == nullptr || T == 0) return true;
+    std::vector<SumoObs *> obs;
+    uint64_t rows = 0;
+    try {
+        for (SumoObs *o : candidates)
+            if (o->kind <= SUMO_OBS_F_ROBUST && fused_h(o->func.h) != nullptr && obs_all_initialised(o)) {
+                obs.push_back(o);
+                rows += o->z.v.rows;
+            }
+        if (obs.size() < 2 || host_for(host, rows / kRowsPerObs, kMinObsPerJob, T) == nullptr) return true;
+        ahead.terms.resize(obs.size());
+        ahead.done.assign(obs.size(), 0);
+        ahead.index.reserve(obs.size());
+        for (uint32_t i = 0; i < obs.size(); ++i) ahead.index.emplace(obs[i], i);
+    } catch (const std::bad_alloc &) {
+        ahead = FusedAhead{};  // the evaluation goes on without
+        return true;
+    }
+    ahead.first = first;
+    ahead.last = last;
+    const uint64_t K = obs.size();
+    std::vector<AheadJob> jobs(T);
+    for (uint32_t j = 0; j < T; ++j)
+        jobs[j] = AheadJob{&ahead, obs.data(), uint32_t(K * j / T), uint32_t(K * (j + 1) / T)};
+    if (!run(host, ahead_job, jobs, function)) return false;
+    sumo->fused_ahead = &ahead;
+    return true;
+}
 
 bool reset_scope(const Scope &scope, uint32_t last, uint32_t n_threads)
 {

@@ -7,7 +7,10 @@
 // (x_E += A_E^-1 b_E, which zeroes b_E and moves b_C by -M^T A_E^-1 b_E); from then on E
 // follows its neighbours' increments through -A_E^-1 M (kept in the blocks' M_work).
 #include <cstdlib>
+#include <new>
+#include <vector>
 
+#include "sumo/fused_kernels.hpp"
 #include "sumo/sumo_internal.hpp"
 
 using namespace sumo;
@@ -152,14 +155,29 @@ PLANO_API Plx_Bool bSumoObsEliminateSelected(Sumo *sumo, SumoWorkspace *workspac
         PLX_ERR_START(PLX_ERROR_ILLEGAL_ARGUMENT, "null argument", 0);
         return PLX_FALSE;
     }
-    for (SumoObs *o = sumo->obs_active; o != nullptr;) {
-        SumoObs *next = o->next;
-        if (predicate(o, context) && !bSumoObsEliminate(sumo, workspace, o, host)) {
+    // The selection is made first, then eliminated in list order. Each elimination evaluates
+    // its observation on its own; the fused kernels, the bulk of that work for image blocks,
+    // run ahead over all jobs for the selected observations (eliminating one observation changes
+    // no parameter, so their terms stay valid through the loop).
+    std::vector<SumoObs *> selected;
+    try {
+        for (SumoObs *o = sumo->obs_active; o != nullptr; o = o->next)
+            if (predicate(o, context)) selected.push_back(o);
+    } catch (const std::bad_alloc &) {
+        PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "selected observations", 0);
+        return PLX_FALSE;
+    }
+    FusedAhead ahead;
+    const AheadInUse in_use(sumo);
+    if (!terms_ahead_of(sumo, selected, kAll, kAll, host, __func__, ahead)) {
+        PLX_ERR_PASS();
+        return PLX_FALSE;
+    }
+    for (SumoObs *o : selected)
+        if (!bSumoObsEliminate(sumo, workspace, o, host)) {
             PLX_ERR_PASS();
             return PLX_FALSE;
         }
-        o = next;
-    }
     return PLX_TRUE;
 }
 
