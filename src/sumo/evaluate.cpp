@@ -289,10 +289,11 @@ FusedResult accumulate_fused(Sumo *sumo, FusedHKernel kernel, SumoObs *obs, uint
 
 namespace sumo {
 
+bool has_fused_kernel(const SumoObs *obs) { return obs->kind <= SUMO_OBS_F_ROBUST && fused_kernel_of(obs) != nullptr; }
+
 bool fused_terms_of(SumoObs *obs, uint32_t first, uint32_t last, FusedTerms *terms)
 {
-    const FusedHKernel kernel = obs->kind <= SUMO_OBS_F_ROBUST ? fused_kernel_of(obs) : nullptr;
-    return kernel != nullptr && fused_terms(kernel, obs, first, last, terms) == FusedResult::done;
+    return has_fused_kernel(obs) && fused_terms(fused_kernel_of(obs), obs, first, last, terms) == FusedResult::done;
 }
 
 bool register_fused_h(SumoHFunction h, FusedHKernel kernel)

@@ -46,6 +46,9 @@ struct FusedTerms {
     double jtnr[kFusedMaxParams];
     double jtnj[kFusedMaxParams * kFusedMaxParams];
 };
+// Whether the optimiser evaluates the observation through a kernel (h type, analytic
+// Jacobians, diagonal information, a kernel paired with its function).
+bool has_fused_kernel(const SumoObs *obs);
 // Writes the terms when the observation has a kernel that takes it; false otherwise (also
 // on a kernel failure, which the evaluation then meets and reports itself).
 bool fused_terms_of(SumoObs *obs, uint32_t first, uint32_t last, FusedTerms *terms);

@@ -283,14 +283,10 @@ bool terms_ahead_of(Sumo *sumo, const std::vector<SumoObs *> &candidates, uint32
     const uint32_t T = sumo->n_threads;
     if (host == nullptr || T == 0) return true;
     std::vector<SumoObs *> obs;
-    uint64_t rows = 0;
     try {
         for (SumoObs *o : candidates)
-            if (o->kind <= SUMO_OBS_F_ROBUST && fused_h(o->func.h) != nullptr && obs_all_initialised(o)) {
-                obs.push_back(o);
-                rows += o->z.v.rows;
-            }
-        if (obs.size() < 2 || host_for(host, rows / kRowsPerObs, kMinObsPerJob, T) == nullptr) return true;
+            if (has_fused_kernel(o) && obs_all_initialised(o)) obs.push_back(o);
+        if (obs.size() < 2 || host_for(host, obs_work(obs), kMinObsPerJob, T) == nullptr) return true;
         ahead.terms.resize(obs.size());
         ahead.done.assign(obs.size(), 0);
         ahead.index.reserve(obs.size());

@@ -80,15 +80,14 @@ PLANO_API double dSumoComputeResidual(Sumo *sumo, uint32_t include_eliminated, c
     const uint32_t T = sumo->n_threads == 0 ? 1 : sumo->n_threads;
     SumoWorkspace *ws = job_workspaces(sumo, T);
     if (ws == nullptr) return SUMO_FAILED_RESIDUAL;
-    std::vector<SumoObs *> obs, eliminated;
+    std::vector<SumoObs *> obs;  // the counted active observations, then the eliminated ones
     if (!collect_counted(sumo, sumo->obs_active, false, obs) ||
-        (include_eliminated && !collect_counted(sumo, sumo->obs_eliminated, false, eliminated))) {
+        (include_eliminated && !collect_counted(sumo, sumo->obs_eliminated, false, obs))) {
         PLX_ERR_PASS();
         return SUMO_FAILED_RESIDUAL;
     }
     std::vector<double> sums;
     try {
-        obs.insert(obs.end(), eliminated.begin(), eliminated.end());
         sums.assign((obs.size() + kCostChunk - 1) / kCostChunk, 0.0);
     } catch (const std::bad_alloc &) {
         PLX_ERR_START(PLX_ERROR_MALLOC_FAILED, "cost chunks", 0);

@@ -4,9 +4,9 @@
 #ifndef PLANO_SRC_SUMO_SUMO_INTERNAL_HPP
 #define PLANO_SRC_SUMO_SUMO_INTERNAL_HPP
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
-#include <algorithm>
 #include <cstring>
 #include <vector>
 

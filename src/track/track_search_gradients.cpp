@@ -25,34 +25,23 @@ inline float difference(bool has_a, float a, float c, bool has_b, float b)
     return 0.f;
 }
 
-// One row of both gradients; C floats per pixel. Masked pixels and their neighbours are
-// tested bit by bit, unmasked rows run as plain loops.
+// One row of both gradients; C floats per pixel. Without a mask every pixel counts as set.
 void gradient_row(const Plx_Image *im, const Plx_Image *mask, int32_t r, uint32_t C, float *gx, float *gy)
 {
     const int32_t w = im->width, h = im->height;
     const auto *row = static_cast<const float *>(plx_image_row(im, r));
     const auto *up = r > 0 ? static_cast<const float *>(plx_image_row(im, r - 1)) : nullptr;
     const auto *down = r + 1 < h ? static_cast<const float *>(plx_image_row(im, r + 1)) : nullptr;
-    if (mask == nullptr) {
-        for (int32_t c = 0; c < w; ++c) {
-            const bool left = c > 0, right = c + 1 < w;
-            for (uint32_t k = 0; k < C; ++k) {
-                const std::size_t i = std::size_t(c) * C + k;
-                gx[i] = difference(left, left ? row[i - C] : 0.f, row[i], right, right ? row[i + C] : 0.f);
-                gy[i] = difference(up != nullptr, up ? up[i] : 0.f, row[i], down != nullptr, down ? down[i] : 0.f);
-            }
-        }
-        return;
-    }
-    const uint32_t *m = bit_row(mask, r);
-    const uint32_t *mu = up ? bit_row(mask, r - 1) : nullptr;
-    const uint32_t *md = down ? bit_row(mask, r + 1) : nullptr;
+    const uint32_t *m = mask ? bit_row(mask, r) : nullptr;
+    const uint32_t *mu = mask && up ? bit_row(mask, r - 1) : nullptr;
+    const uint32_t *md = mask && down ? bit_row(mask, r + 1) : nullptr;
+    auto set = [mask](const uint32_t *bits, int32_t c) { return mask == nullptr || test_bit(bits, c); };
     for (int32_t c = 0; c < w; ++c) {
-        const bool centre = test_bit(m, c);
-        const bool left = centre && c > 0 && test_bit(m, c - 1);
-        const bool right = centre && c + 1 < w && test_bit(m, c + 1);
-        const bool above = centre && mu != nullptr && test_bit(mu, c);
-        const bool below = centre && md != nullptr && test_bit(md, c);
+        const bool centre = set(m, c);
+        const bool left = centre && c > 0 && set(m, c - 1);
+        const bool right = centre && c + 1 < w && set(m, c + 1);
+        const bool above = centre && up != nullptr && set(mu, c);
+        const bool below = centre && down != nullptr && set(md, c);
         for (uint32_t k = 0; k < C; ++k) {
             const std::size_t i = std::size_t(c) * C + k;
             gx[i] = difference(left, left ? row[i - C] : 0.f, row[i], right, right ? row[i + C] : 0.f);
