@@ -1,7 +1,7 @@
 # Entry points of the README. Every target installs missing Debian packages first.
 BUILD ?= build
 JOBS ?= 2
-PACKAGES = cmake g++ make libeigen3-dev libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev libopenimageio-dev
+PACKAGES = cmake g++ make pkg-config ccache libeigen3-dev libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev libopenimageio-dev
 PEER_PACKAGES = libopencv-dev libceres-dev
 
 .PHONY: setup build test demo bench sanitize clean

@@ -24,7 +24,9 @@ typedef struct MatchMoveKey {
  * key, frames up to 2^31 - 1, finite corners), positions and dimensions multiplied by scale.
  * The node name must be a non-empty word without white space, so that the script reads back.
  * Bad arguments: code 32 (an empty list 24, frames out of order 7); nothing is written then.
- * The file cannot be opened: code 25; a failed write: code 36 and the partial file is removed. */
+ * The file cannot be opened: code 25; a failed write: code 36. An existing regular file is
+ * replaced only once the new script is complete, so a failed write leaves it as it was; a
+ * device or pipe is written in place; a path the call did not create is never removed. */
 PLANO_API Plx_Bool bWriteShakeMatchMoveFile(const char *path, int32_t height, int32_t width,
                                             const char *node_name, const Plx_List *keys,
                                             double scale);

@@ -117,9 +117,11 @@ bool full_storage(Plx_SquMatrixType type)
            type == PLX_SQUMAT_UPPER_TRIANGULAR || type == PLX_SQUMAT_GENERIC;
 }
 
-bool known_squmat(Plx_SquMatrixType type)
+// Takes the stored number, not the enum: a number outside the enum's values must be refused
+// before it is ever held in one.
+bool known_squmat(uint32_t code)
 {
-    return full_storage(type) || type == PLX_SQUMAT_DIAGONAL || type == PLX_SQUMAT_SCALED_IDENTITY;
+    return code >= PLX_SQUMAT_SYMMETRIC && code <= PLX_SQUMAT_GENERIC;
 }
 
 // Restores what the structure implies after reading only part of a full array: the mirrored
@@ -371,7 +373,7 @@ PLX_API Plx_Bool plx_vec_fwrite(FILE *file, const Plx_Vector *x, uint32_t magic)
 PLX_API Plx_Bool plx_squmat_fwrite(FILE *file, const Plx_SquMatrix *A, uint32_t magic)
 {
     if (!check_file(file, A, __func__)) return PLX_FALSE;
-    if (!known_squmat(A->type)) {
+    if (!known_squmat(static_cast<uint32_t>(A->type))) {
         PLX_ERR_START(PLX_ERROR_ILLEGAL_TYPE, "unknown square matrix type", A->type);
         return PLX_FALSE;
     }
@@ -423,12 +425,12 @@ PLX_API Plx_SquMatrix *plx_squmat_fread(FILE *file, Plx_SquMatrix *A, uint32_t m
     if (!check_file(file, file, __func__)) return nullptr;
     uint32_t sizes[2];
     if (!read_heading(file, magic, sizes, 2, __func__)) return nullptr;
-    auto type = static_cast<Plx_SquMatrixType>(sizes[0]);
-    uint32_t n = sizes[1];
-    if (!known_squmat(type)) {
+    if (!known_squmat(sizes[0])) {
         PLX_ERR_START(PLX_ERROR_CORRUPTED_FILE, "unknown square matrix type", sizes[0]);
         return nullptr;
     }
+    auto type = static_cast<Plx_SquMatrixType>(sizes[0]);
+    uint32_t n = sizes[1];
     Plx_SquMatrix *rec = read_record(
         A, [&](Plx_SquMatrix *m) { return plx_squmat_form(m, type, n); },
         [&](Plx_SquMatrix *m) {

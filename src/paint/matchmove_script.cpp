@@ -1,6 +1,11 @@
 // Four-corner match-move scripts: the writer produces the compositor's node text, the reader
 // takes back only the eight corner curves.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <charconv>
 #include <cmath>
@@ -272,11 +277,16 @@ ReadResult parse_script(const std::string &text, int32_t height, int32_t width, 
     return result;
 }
 
+// Reads the whole file, except that one whose first byte cannot start a script is not read
+// on (an endless device or a large binary file fails at once).
 bool read_file(FILE *file, std::string &text)
 {
     char buffer[65536];
     size_t n;
-    while ((n = std::fread(buffer, 1, sizeof buffer, file)) > 0) text.append(buffer, n);
+    while ((n = std::fread(buffer, 1, sizeof buffer, file)) > 0) {
+        text.append(buffer, n);
+        if (text[0] != '#') break;
+    }
     return !std::ferror(file);
 }
 
@@ -285,6 +295,35 @@ struct FileCloser {
 };
 
 void free_key(void *key) { std::free(key); }
+
+// A new file in the folder of path, named after it; null (errno set) when none can be made
+// there, for example in a folder the caller may not write.
+FILE *open_beside(const char *path, std::string &made)
+{
+    static std::atomic<unsigned> count{0};
+    std::string name(path);
+    size_t slash = name.rfind('/');
+    std::string folder = slash == std::string::npos ? std::string() : name.substr(0, slash + 1);
+    std::string base = slash == std::string::npos ? name : name.substr(slash + 1);
+    for (int attempt = 0; attempt < 16; ++attempt) {
+        std::string candidate = folder + "." + base + ".tmp" + std::to_string(::getpid()) + "-" +
+                                std::to_string(count++);
+        int fd = ::open(candidate.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+        if (fd < 0) {
+            if (errno == EEXIST) continue;
+            return nullptr;
+        }
+        FILE *file = ::fdopen(fd, "w");
+        if (file == nullptr) {
+            ::close(fd);
+            ::unlink(candidate.c_str());
+            return nullptr;
+        }
+        made = candidate;
+        return file;
+    }
+    return nullptr;
+}
 
 }  // namespace
 
@@ -358,16 +397,31 @@ PLANO_API Plx_Bool bWriteShakeMatchMoveFile(const char *path, int32_t height, in
         return PLX_FALSE;
     }
 
-    FILE *file = std::fopen(path, "w");
+    // A regular file is replaced whole: the script goes to a new file beside it, renamed over
+    // it once complete, so a failed write leaves the earlier script as it was. A device or a
+    // pipe is written in place, and nothing this call did not make is ever removed.
+    struct stat target;
+    const bool exists = ::stat(path, &target) == 0;
+    std::string temporary;
+    FILE *file = nullptr;
+    if (!exists || S_ISREG(target.st_mode)) {
+        file = open_beside(path, temporary);
+        if (file != nullptr && exists) ::fchmod(::fileno(file), target.st_mode & 07777);
+    }
+    if (file == nullptr) file = std::fopen(path, "w");
     if (file == nullptr) {
         // Registered under the name callers of the compositor bridge have always searched for.
         PLX_ERR_START_AS("pWriteShakeMatchMoveFile", PLX_ERROR_OPENING_FILE, path, errno);
         return PLX_FALSE;
     }
     bool written = std::fwrite(text.data(), 1, text.size(), file) == text.size();
+    written = std::fflush(file) == 0 && written;
+    if (!temporary.empty()) written = ::fsync(::fileno(file)) == 0 && written;
     written = (std::fclose(file) == 0) && written;
+    if (written && !temporary.empty()) written = std::rename(temporary.c_str(), path) == 0;
     if (!written) {
-        std::remove(path);
+        if (!temporary.empty()) std::remove(temporary.c_str());
+        else if (!exists) std::remove(path);
         PLX_ERR_START(PLX_ERROR_WRITING_FILE, path, 0);
         return PLX_FALSE;
     }

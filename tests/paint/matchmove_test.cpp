@@ -1,5 +1,10 @@
 // Match-move scripts: the writer's exact text, reading back, renumbering and malformed files.
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
 
 #include <cmath>
 #include <cstdio>
@@ -344,6 +349,41 @@ TEST(MatchMoveScript, FilesAndArguments)
     EXPECT_EQ(origin_code(), 32);
     EXPECT_FALSE(bReadShakeMatchMoveFile(path.c_str(), &height, &width, nullptr, 0, nullptr));
     EXPECT_EQ(origin_code(), 32);
+}
+
+// A write that fails part-way (here past a file-size limit, in a child process) leaves the
+// earlier script byte for byte and no file of its own; a device is written in place and kept;
+// an endless device is refused at its first byte.
+TEST(MatchMoveScript, FailedWritesKeepWhatWasThere)
+{
+    KeyList k, longer;
+    two_keys(k);
+    for (uint32_t f = 1; f <= 200; ++f) longer.add(f, {1, 2, 3, 4, 5, 6, 7, 8});
+    std::string path = temp_path("kept.shk");
+    ASSERT_TRUE(bWriteShakeMatchMoveFile(path.c_str(), 100, 200, "Corners", k.list, 1.0));
+    const std::string before = slurp(path);
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        std::signal(SIGXFSZ, SIG_IGN);
+        rlimit limit{512, 512};
+        setrlimit(RLIMIT_FSIZE, &limit);
+        bool failed = !bWriteShakeMatchMoveFile(path.c_str(), 100, 200, "Corners", longer.list, 1.0);
+        _exit(failed && origin_code() == 36 ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "the write did not fail with 36";
+    EXPECT_EQ(slurp(path), before);
+    for (const auto &entry : fs::directory_iterator(fs::path(path).parent_path()))
+        EXPECT_EQ(entry.path().filename().string().find("kept.shk.tmp"), std::string::npos) << entry.path();
+
+    EXPECT_TRUE(bWriteShakeMatchMoveFile("/dev/null", 100, 200, "Corners", k.list, 1.0));
+    EXPECT_TRUE(fs::is_character_file("/dev/null"));
+    int32_t height = 100, width = 200;
+    Plx_List *read = nullptr;
+    EXPECT_FALSE(bReadShakeMatchMoveFile("/dev/zero", &height, &width, nullptr, 0, &read));
+    EXPECT_EQ(origin_code(), 26);
 }
 
 }  // namespace

@@ -250,6 +250,20 @@ TEST(FileIO, BinaryBlocksRoundTripWithTheirMagicNumbers)
     EXPECT_TRUE(fails_with(plx_mat_fread(f, nullptr, 1u), PLX_ERROR_CORRUPTED_FILE));
     std::fclose(f);
 
+    // A stored square-matrix type outside the known ones is a malformed file.
+    for (uint8_t stored : {uint8_t{0}, uint8_t{7}, uint8_t{99}}) {
+        Plx_SquMatrix A = square_of(PLX_SQUMAT_SYMMETRIC, 2);
+        f = std::tmpfile();
+        ASSERT_TRUE(plx_squmat_fwrite(f, &A, 1u));
+        std::vector<unsigned char> block = bytes_of(f);
+        std::fclose(f);
+        block[4] = stored;
+        f = file_with(block);
+        EXPECT_TRUE(fails_with(plx_squmat_fread(f, nullptr, 1u), PLX_ERROR_CORRUPTED_FILE)) << int(stored);
+        std::fclose(f);
+        plx_squmat_free(&A);
+    }
+
     Plx_SquMatrix bad{};
     bad.type = PLX_SQUMAT_NONE;
     f = std::tmpfile();

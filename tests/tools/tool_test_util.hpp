@@ -60,10 +60,11 @@ inline fs::path test_dir()
     return dir;
 }
 
-// Runs the tool with its arguments (no shell interpretation of them) in dir.
-inline ToolRun run_tool(const fs::path &dir, const std::vector<std::string> &args)
+// Runs the tool with its arguments (no shell interpretation of them) in dir; shell_prefix
+// (for example "ulimit -f 8 &&") runs before it in the same shell.
+inline ToolRun run_tool(const fs::path &dir, const std::vector<std::string> &args, const std::string &shell_prefix = "")
 {
-    std::string command = "cd " + quoted(dir.string()) + " && " + quoted(PLANO_TOOL_PATH);
+    std::string command = "cd " + quoted(dir.string()) + " && " + shell_prefix + " " + quoted(PLANO_TOOL_PATH);
     for (const std::string &a : args) {
         command += ' ';
         command += quoted(a);

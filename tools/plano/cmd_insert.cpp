@@ -23,12 +23,12 @@ int run_insert(const InsertOptions &o)
     FramePattern plates(o.sequence.empty() ? track.sequence : o.sequence);
     FramePattern output(o.output);
     std::vector<const FrameResult *> frames = frames_to_render(track, o.frames);
-    if (!(o.feather >= 0)) throw ToolError("feather must be 0 or more pixels");
+    if (!(o.feather >= 0 && o.feather <= 10000)) throw ToolError("feather must be 0 to 10000 pixels");
     ImagePtr insert = prepare_insert(*read_image(o.image));
     HostPtr host = make_host(o.threads);
     ProgressBar progress("insert", static_cast<int>(frames.size()), !o.quiet);
     int untracked = 0;
-    const double fps = render_frames(track, plates, output, frames, progress,
+    const double fps = render_frames(track, plates, output, frames, {o.track, o.image}, progress,
                                      [&](const Plx_Image &plate, const FrameResult &f) -> ImagePtr {
                                          if (f.status == TRACK_REGION_OK)
                                              return insert_onto(plate, *insert, f.corners, o.feather,

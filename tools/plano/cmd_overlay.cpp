@@ -24,8 +24,8 @@ std::array<float, 3> parse_colour(const std::string &text)
         if (ch == ',') ch = ' ';
     double r, g, b;
     char extra;
-    if (std::sscanf(spaced.c_str(), "%lf %lf %lf %c", &r, &g, &b, &extra) != 3 || r < 0 || g < 0 || b < 0 ||
-        r > 1 || g > 1 || b > 1)
+    auto unit = [](double v) { return v >= 0 && v <= 1; };  // false for NaN too
+    if (std::sscanf(spaced.c_str(), "%lf %lf %lf %c", &r, &g, &b, &extra) != 3 || !unit(r) || !unit(g) || !unit(b))
         throw ToolError("colour '" + text + "' is not three numbers 0..1 (r,g,b)");
     c = {float(r), float(g), float(b)};
     return c;
@@ -41,7 +41,7 @@ int run_overlay(const OverlayOptions &o)
     if (!(o.thickness > 0 && o.thickness <= 100)) throw ToolError("thickness must be in (0, 100] pixels");
     HostPtr host = make_host(1);  // for Ctrl-C
     ProgressBar progress("overlay", static_cast<int>(frames.size()), !o.quiet);
-    const double fps = render_frames(track, plates, output, frames, progress,
+    const double fps = render_frames(track, plates, output, frames, {o.track}, progress,
                                      [&](const Plx_Image &plate, const FrameResult &f) {
                                          return overlay_quad(plate, f.corners, f.status == TRACK_REGION_OK ? ok : lost,
                                                              o.thickness);

@@ -4,8 +4,10 @@
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 
 #include "commands.hpp"
+#include "files.hpp"
 #include "sequence.hpp"
 
 namespace plano_tool {
@@ -37,6 +39,22 @@ Plx_Matrix33 identity()
     return I;
 }
 
+// A search reaching past the plate finds nothing there but costs memory and time with the
+// square of the range: along each axis the range is cut to the farthest plate edge from the
+// region.
+uint32_t clipped_search_range(uint32_t range, const Quad &quad, double Point::*axis, int32_t size)
+{
+    double lo = INFINITY, hi = -INFINITY;
+    for (const Point &p : quad) {
+        lo = std::min(lo, p.*axis);
+        hi = std::max(hi, p.*axis);
+    }
+    lo = std::clamp(lo, 0.0, double(size));
+    hi = std::clamp(hi, 0.0, double(size));
+    double reach = std::ceil(std::max(lo, size - hi)) + 1;
+    return static_cast<uint32_t>(std::min(double(range), reach));
+}
+
 // One frame pair: the region of the reference frame, at H_previous in the previous frame,
 // searched for in the current frame.
 FrameResult track_pair(const TrackJob &job, const Plx_Image &reference, const Plx_Image &previous,
@@ -56,6 +74,8 @@ FrameResult track_pair(const TrackJob &job, const Plx_Image &reference, const Pl
     }
     Plx_Camera camera;
     check(plx_camera_build_linear(&camera, 1.0, 1.0, 1.0, 0.0, 0.0), "camera");
+    const uint32_t range_x = clipped_search_range(s.search_range, out.corners, &Point::x, previous.width);
+    const uint32_t range_y = clipped_search_range(s.search_range, out.corners, &Point::y, previous.height);
     std::unique_ptr<Track, TrackDeleter> track(
         pTrackNew(const_cast<Plx_Image *>(&previous), &camera, const_cast<Plx_Image *>(&current), &camera,
                   s.levels, nullptr));
@@ -66,7 +86,7 @@ FrameResult track_pair(const TrackJob &job, const Plx_Image &reference, const Pl
     TrackRegion *region = pTrackRegion(
         track.get(), previous_mask.get(), reference_image, &camera, const_cast<Plx_Image *>(&reference_mask),
         nullptr, &H_previous, nullptr, intensity, kSmoothingSigma, kCorrelationSize,
-        s.rotation_range_deg * M_PI / 180.0, s.scale_range, kRotationStep, s.search_range, s.search_range,
+        s.rotation_range_deg * M_PI / 180.0, s.scale_range, kRotationStep, range_y, range_x,
         s.model, kMinOverlap, 0.0, kMinCorrScore, kMinPixelCount, 0.0, kSmoothingPasses, 0.0, 1, 0.0,
         kBlockSize, kIntensitySigma, 0.0, kOutlierCutoff, nullptr, nullptr, nullptr, nullptr, nullptr, nullptr,
         nullptr, nullptr, nullptr, host);
@@ -161,12 +181,22 @@ int run_track(const TrackOptions &o)
     if (s.levels < 1 || s.levels > 8) throw ToolError("levels must be 1 to 8");
     if (!(o.rotation_range >= 0 && o.rotation_range <= 180)) throw ToolError("rotation range must be 0 to 180 degrees");
     if (!(o.scale_range >= 0 && o.scale_range < 1)) throw ToolError("scale range must be 0 to below 1");
-    if (o.iterations < 1) throw ToolError("iterations must be 1 or more");
+    if (o.iterations < 1 || o.iterations > 1000) throw ToolError("iterations must be 1 to 1000");
+    int given = !o.quad.empty() + !o.mask.empty() + !o.init_from.empty();
+    if (given != 1) throw ToolError("give the region as one of --quad, --mask or --init-from");
+
+    // Nothing is read or written before every output is known to be safe to write.
+    PathCheck paths;
+    for (int frame = range.first; frame <= range.last; ++frame) paths.input(pattern.path(frame));
+    if (!o.mask.empty()) paths.input(o.mask);
+    if (!o.init_from.empty()) paths.input(o.init_from);
+    paths.output(o.output, "--output");
+    if (!o.csv.empty()) paths.output(o.csv, "--csv");
+    if (!o.script.empty()) paths.output(o.script, "--script");
+    paths.check();
 
     FrameCache cache(pattern, job.reference);
     std::shared_ptr<const Plx_Image> reference = cache.get(job.reference);
-    int given = !o.quad.empty() + !o.mask.empty() + !o.init_from.empty();
-    if (given != 1) throw ToolError("give the region as one of --quad, --mask or --init-from");
     if (!o.quad.empty()) {
         job.reference_quad = parse_quad(o.quad);
     } else if (!o.mask.empty()) {
@@ -204,21 +234,34 @@ int run_track(const TrackOptions &o)
     plano_host_set_progress_callback(host.get(), nullptr, nullptr);
     double fps = progress.finish();
 
+    // A run that stopped early never replaces an earlier file: its result goes beside it.
+    auto destination = [&](const std::string &path) {
+        std::error_code ec;
+        return result.complete || !std::filesystem::exists(path, ec) ? path : partial_path(path);
+    };
+    const std::string json_path = destination(o.output);
     if (!result.frames.empty()) {
-        write_json(o.output, result);
-        if (!o.csv.empty()) write_csv(o.csv, result);
-        if (!o.script.empty()) write_script(o.script, result, o.node);
+        write_json(json_path, result);
+        if (!o.csv.empty()) write_csv(destination(o.csv), result);
+        if (!o.script.empty()) write_script(destination(o.script), result, o.node);
     }
-    int lost = 0;
-    for (const FrameResult &f : result.frames) lost += f.status != TRACK_REGION_OK;
-    std::string written = std::to_string(result.frames.size()) + " frames written to " + o.output;
+    int lost = 0, unreadable = 0;
+    for (const FrameResult &f : result.frames) {
+        unreadable += f.status == kStatusUnreadable;
+        lost += f.status != TRACK_REGION_OK && f.status != kStatusUnreadable;
+    }
+    std::string written = std::to_string(result.frames.size()) + " frames written to " + json_path;
+    if (json_path != o.output) written += " ('" + o.output + "' kept)";
     if (!failure.empty()) throw ToolError(failure + (result.frames.empty() ? "" : "; " + written));
     if (!result.complete && result.stopped == "interrupted")
         throw ToolError("interrupted; " + written, kExitInterrupted);
     if (!result.complete) throw ToolError("region " + result.stopped + "; " + written, kExitLost);
+    auto count = [](int n, const char *what) {
+        return n ? ", " + std::to_string(n) + (n == 1 ? " frame " : " frames ") + what : std::string();
+    };
     if (!o.quiet)
-        std::fprintf(stderr, "plano track: %s (%.2f fps)%s\n", written.c_str(), fps,
-                     lost ? (", " + std::to_string(lost) + (lost == 1 ? " frame" : " frames") + " lost").c_str() : "");
+        std::fprintf(stderr, "plano track: %s (%.2f fps)%s%s\n", written.c_str(), fps, count(lost, "lost").c_str(),
+                     count(unreadable, "unreadable").c_str());
     return 0;
 }
 
@@ -239,7 +282,24 @@ void track_both_ways(const TrackJob &job, const FrameLoader &frames, const Threa
                 result.stopped = "interrupted";
                 return;
             }
-            std::shared_ptr<const Plx_Image> current = frames(frame);
+            std::shared_ptr<const Plx_Image> current;
+            try {
+                current = frames(frame);
+            } catch (const ToolError &e) {
+                // Told to go on, an unreadable frame is marked, and the next one is searched
+                // from the last frame that was tracked.
+                if (!job.settings.continue_when_lost) throw;
+                FrameResult f;
+                f.frame = frame;
+                f.status = kStatusUnreadable;
+                f.reason = e.what();
+                f.homography = H;
+                f.corners = map_through(H, job.reference_quad);
+                f.rms_residual = INFINITY;
+                done.push_back(f);
+                progress.frame_done();
+                continue;
+            }
             FrameResult f = track_pair(job, *reference, *previous, *current, reference_mask, H, intensity, frame, host);
             // An interrupt inside the engine leaves this frame half done: it is not kept.
             if (interrupted()) {

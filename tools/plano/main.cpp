@@ -1,4 +1,5 @@
 // plano: planar tracking, screen replacement and review overlays on image sequences.
+#include <csignal>
 #include <cstdio>
 #include <exception>
 
@@ -8,6 +9,9 @@ int main(int argc, char **argv)
 {
     using namespace plano_tool;
     catch_interrupts();
+    // Past a file-size limit a write then fails with an error the tool reports, instead of
+    // the signal ending the process half-way through a file.
+    std::signal(SIGXFSZ, SIG_IGN);
     CLI::App app("plano: planar tracking of image sequences with the Plano engine");
     app.require_subcommand(1);
     int exit_code = 0;
@@ -29,7 +33,7 @@ int main(int argc, char **argv)
     } catch (const CLI::ParseError &e) {
         bool known = false;
         for (const CLI::App *sub : app.get_subcommands({})) known = known || sub->get_name() == command;
-        std::fprintf(stderr, "plano: %s (see plano %s--help)\n", e.what(), known ? (command + " ").c_str() : "");
+        std::fprintf(stderr, "plano: %s (see plano %s--help)\n", one_line(e.what()).c_str(), known ? (command + " ").c_str() : "");
         return kExitFailure;
     } catch (const ToolError &e) {
         std::fprintf(stderr, "plano %s: %s\n", command.c_str(), e.what());
@@ -38,7 +42,7 @@ int main(int argc, char **argv)
         std::fprintf(stderr, "plano %s: out of memory\n", command.c_str());
         return kExitFailure;
     } catch (const std::exception &e) {
-        std::fprintf(stderr, "plano %s: %s\n", command.c_str(), e.what());
+        std::fprintf(stderr, "plano %s: %s\n", command.c_str(), one_line(e.what()).c_str());
         return kExitFailure;
     }
     return exit_code;

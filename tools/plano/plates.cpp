@@ -2,8 +2,8 @@
 #include "plates.hpp"
 
 #include <climits>
-#include <filesystem>
 
+#include "files.hpp"
 #include "sequence.hpp"
 #include "tool.hpp"
 
@@ -21,30 +21,33 @@ std::vector<const FrameResult *> frames_to_render(const TrackResult &result, con
     return out;
 }
 
-// Checks the plate against the track and that the output will not overwrite it.
-void check_plate(const Plx_Image &plate, const TrackResult &track, const std::string &plate_path,
-                 const std::string &out_path)
+// Checks the plate against the track.
+void check_plate(const Plx_Image &plate, const TrackResult &track, const std::string &plate_path)
 {
     if (plate.width != track.width || plate.height != track.height)
         throw ToolError("'" + plate_path + "' is " + std::to_string(plate.width) + "x" +
                         std::to_string(plate.height) + " but the track was made on " +
                         std::to_string(track.width) + "x" + std::to_string(track.height) + " plates");
-    std::error_code ec1, ec2;
-    if (plate_path == out_path ||
-        std::filesystem::weakly_canonical(plate_path, ec1) == std::filesystem::weakly_canonical(out_path, ec2))
-        throw ToolError("output '" + out_path + "' would overwrite its plate");
 }
 
 double render_frames(const TrackResult &track, const FramePattern &plates, const FramePattern &output,
-                     const std::vector<const FrameResult *> &frames, ProgressBar &progress,
+                     const std::vector<const FrameResult *> &frames, const std::vector<std::string> &inputs,
+                     ProgressBar &progress,
                      const std::function<ImagePtr(const Plx_Image &plate, const FrameResult &frame)> &render)
 {
+    PathCheck paths;
+    for (const std::string &path : inputs) paths.input(path);
+    for (const FrameResult *f : frames) {
+        paths.input(plates.path(f->frame));
+        paths.output(output.path(f->frame), "--output");
+    }
+    paths.check();
     for (const FrameResult *f : frames) {
         if (interrupted())
             throw ToolError("interrupted; " + std::to_string(progress.done()) + " frames written", kExitInterrupted);
         std::string plate_path = plates.path(f->frame), out_path = output.path(f->frame);
         ImagePtr plate = read_image(plate_path);
-        check_plate(*plate, track, plate_path, out_path);
+        check_plate(*plate, track, plate_path);
         ImagePtr frame = render(*plate, *f);
         write_image(out_path, frame ? *frame : *plate);
         progress.frame_done();

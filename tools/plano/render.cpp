@@ -88,6 +88,13 @@ ImagePtr insert_onto(const Plx_Image &plate, const Plx_Image &insert, const Quad
                     f = static_cast<float>(std::clamp(d, 0.0, 1.0));
                 }
                 float a = l[3] * f;
+                // Where the insert covers the plate fully nothing of the plate is kept, not
+                // even a non-finite value (which times zero would spread as NaN).
+                if (a >= 1.0f) {
+                    for (int k = 0; k < 3; ++k) o[k] = l[k] * f;
+                    o[3] = 1.0f;
+                    continue;
+                }
                 for (int k = 0; k < 3; ++k) o[k] = l[k] * f + o[k] * (1.0f - a);
                 o[3] = a + o[3] * (1.0f - a);
             }

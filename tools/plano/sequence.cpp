@@ -2,11 +2,15 @@
 #include "sequence.hpp"
 
 #include <OpenImageIO/imageio.h>
+#include <fcntl.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
 #include <filesystem>
 #include <cctype>
+
+#include "files.hpp"
 
 namespace plano_tool {
 
@@ -154,28 +158,64 @@ OIIO::TypeDesc oiio_type(Plx_PixelType type)
 
 }  // namespace
 
+namespace {
+
+// Some image libraries print their own errors to stderr besides returning them; the tool's
+// one-line message carries the reason, so their text is sent nowhere while a file is read.
+class QuietStderr {
+public:
+    QuietStderr()
+    {
+        std::fflush(stderr);
+        saved_ = ::dup(STDERR_FILENO);
+        int null = ::open("/dev/null", O_WRONLY | O_CLOEXEC);
+        if (saved_ >= 0 && null >= 0) ::dup2(null, STDERR_FILENO);
+        if (null >= 0) ::close(null);
+    }
+    ~QuietStderr()
+    {
+        std::fflush(stderr);
+        if (saved_ >= 0) {
+            ::dup2(saved_, STDERR_FILENO);
+            ::close(saved_);
+        }
+    }
+    QuietStderr(const QuietStderr &) = delete;
+    QuietStderr &operator=(const QuietStderr &) = delete;
+
+private:
+    int saved_ = -1;
+};
+
+}  // namespace
+
 ImagePtr read_image(const std::string &path)
 {
     std::error_code ec;
     if (!fs::exists(path, ec)) throw ToolError("cannot read '" + path + "': no such file");
+    auto fail = [&](const std::string &reason) -> void { throw ToolError("cannot read '" + path + "': " + reason); };
+    QuietStderr quiet;
     auto in = OIIO::ImageInput::open(path);
     if (!in) {
         std::string reason = OIIO::geterror();
-        throw ToolError("cannot read '" + path + "': " + (reason.empty() ? "unknown format" : reason));
+        fail(reason.empty() ? "unknown format" : reason);
     }
     const OIIO::ImageSpec &spec = in->spec();
-    if (spec.width < 1 || spec.height < 1 || spec.nchannels < 1 || spec.depth > 1)
-        throw ToolError("cannot read '" + path + "': not a 2D image");
+    if (spec.width < 1 || spec.height < 1 || spec.nchannels < 1 || spec.depth > 1) fail("not a 2D image");
+    if (int64_t{spec.width} * spec.height > kMaxImagePixels)
+        fail(std::to_string(spec.width) + "x" + std::to_string(spec.height) + " is more than the " +
+             std::to_string(kMaxImagePixels >> 20) + " million pixels an image may have");
     int channels = std::min(spec.nchannels, 4);
     Plx_PixelType type = spec.format == OIIO::TypeDesc::UINT8    ? PLX_TYPE_UCHAR
                          : spec.format == OIIO::TypeDesc::UINT16 ? PLX_TYPE_USHORT
                                                                  : PLX_TYPE_FLOAT;
     ImagePtr image = make_image(format_of_channels(channels), type, spec.height, spec.width);
     OIIO::stride_t pixel_bytes = static_cast<OIIO::stride_t>(channels * plx_image_type_size(type));
-    if (!in->read_image(0, 0, 0, channels, oiio_type(type), image->data, pixel_bytes, image->stride)) {
-        std::string reason = in->geterror();
-        throw ToolError("cannot read '" + path + "': " + (reason.empty() ? "read failed" : reason));
-    }
+    bool read = in->read_image(0, 0, 0, channels, oiio_type(type), image->data, pixel_bytes, image->stride);
+    // A reader may fill what it could not decode and still report success (a JPEG cut short
+    // does): any error it recorded fails the read.
+    std::string reason = in->geterror();
+    if (!read || !reason.empty()) fail(reason.empty() ? "read failed" : reason);
     in->close();
     return image;
 }
@@ -194,19 +234,18 @@ void write_image(const std::string &path, const Plx_Image &source)
         converted = convert_image(source, format, type);
         image = converted.get();
     }
-    fs::path parent = fs::path(path).parent_path();
-    std::error_code ec;
-    if (!parent.empty()) fs::create_directories(parent, ec);
-    auto out = OIIO::ImageOutput::create(path);
-    if (!out) throw ToolError("cannot write '" + path + "': " + OIIO::geterror());
-    int channels = static_cast<int>(plx_image_format_channels(format));
-    OIIO::ImageSpec spec(image->width, image->height, channels, oiio_type(type));
-    if (channels == 2) spec.alpha_channel = 1;
-    if (channels == 4) spec.alpha_channel = 3;
-    OIIO::stride_t pixel_bytes = static_cast<OIIO::stride_t>(channels * plx_image_type_size(type));
-    if (!out->open(path, spec) ||
-        !out->write_image(oiio_type(type), image->data, pixel_bytes, image->stride) || !out->close())
-        throw ToolError("cannot write '" + path + "': " + out->geterror());
+    write_atomically(path, [&](const std::string &temporary) {
+        auto out = OIIO::ImageOutput::create(path);
+        if (!out) throw ToolError("cannot write '" + path + "': " + OIIO::geterror());
+        int channels = static_cast<int>(plx_image_format_channels(format));
+        OIIO::ImageSpec spec(image->width, image->height, channels, oiio_type(type));
+        if (channels == 2) spec.alpha_channel = 1;
+        if (channels == 4) spec.alpha_channel = 3;
+        OIIO::stride_t pixel_bytes = static_cast<OIIO::stride_t>(channels * plx_image_type_size(type));
+        if (!out->open(temporary, spec) ||
+            !out->write_image(oiio_type(type), image->data, pixel_bytes, image->stride) || !out->close())
+            throw ToolError("cannot write '" + path + "': " + out->geterror());
+    });
 }
 
 }  // namespace plano_tool

@@ -39,7 +39,7 @@ FrameRange resolve_frame_range(const FramePattern &pattern, const std::string &t
 // float; 1 to 4 channels as grey, grey-alpha, RGB, RGBA (further channels are dropped).
 ImagePtr read_image(const std::string &path);
 // Writes an image in its own type (bit images as 8-bit grey); the file's format follows the
-// extension. Folders along the path are made.
+// extension. Written atomically: see write_atomically.
 void write_image(const std::string &path, const Plx_Image &image);
 
 }  // namespace plano_tool

@@ -6,6 +6,28 @@
 
 namespace plano_tool {
 
+std::string one_line(const std::string &text)
+{
+    constexpr size_t kMostCharacters = 400;
+    std::string out;
+    size_t begin = 0;
+    while (begin <= text.size()) {
+        size_t end = text.find_first_of("\r\n", begin);
+        if (end == std::string::npos) end = text.size();
+        size_t first = text.find_first_not_of(" \t", begin);
+        size_t last = text.find_last_not_of(" \t", end == 0 ? 0 : end - 1);
+        if (first != std::string::npos && first < end && last != std::string::npos && last >= first) {
+            if (!out.empty()) out += "; ";
+            out.append(text, first, last - first + 1);
+        }
+        begin = end + 1;
+    }
+    for (char &c : out)
+        if (c == '\t' || static_cast<unsigned char>(c) < 0x20) c = ' ';
+    if (out.size() > kMostCharacters) out = out.substr(0, kMostCharacters - 3) + "...";
+    return out;
+}
+
 std::string library_reason()
 {
     char buffer[512];
@@ -68,6 +90,7 @@ void HostDeleter::operator()(PlanoHost *host) const noexcept
 
 HostPtr make_host(uint32_t threads)
 {
+    if (threads > kMaxThreads) throw ToolError("threads must be 0 (one per core) to " + std::to_string(kMaxThreads));
     HostPtr host(plano_host_new(threads));
     if (!host) throw ToolError("cannot make the thread host (out of memory)");
     g_host.store(host.get());

@@ -11,11 +11,15 @@
 
 namespace plano_tool {
 
+// Text of several lines (a library's message) as one line: its lines trimmed and joined by
+// "; ", cut to a length a terminal line holds.
+std::string one_line(const std::string &text);
+
 // A failure the user can act on; main prints "plano <command>: <message>" on one line.
 class ToolError : public std::runtime_error {
 public:
     explicit ToolError(const std::string &message, int exit_code = 1)
-        : std::runtime_error(message), exit_code_(exit_code)
+        : std::runtime_error(one_line(message)), exit_code_(exit_code)
     {
     }
     int exit_code() const { return exit_code_; }
@@ -49,8 +53,9 @@ struct HostDeleter {
 };
 using HostPtr = std::unique_ptr<PlanoHost, HostDeleter>;
 
-// A reference host with `threads` jobs (0: one per hardware thread) whose interrupt flag is
-// raised by Ctrl-C while it lives (see catch_interrupts).
+constexpr uint32_t kMaxThreads = 256;
+// A reference host with `threads` jobs (0: one per hardware thread; at most kMaxThreads)
+// whose interrupt flag is raised by Ctrl-C while it lives (see catch_interrupts).
 HostPtr make_host(uint32_t threads);
 // From now on Ctrl-C (and SIGTERM) raise the interrupt flag instead of ending the process.
 void catch_interrupts();

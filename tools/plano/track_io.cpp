@@ -4,9 +4,10 @@
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
-#include <fstream>
+#include <sstream>
 #include <nlohmann/json.hpp>
 
+#include "files.hpp"
 #include "plano/matchmove.h"
 
 namespace plano_tool {
@@ -22,11 +23,32 @@ std::string status_name(uint32_t status)
     case TRACK_REGION_PYRAMID_FAILED: return "pyramid failed";
     case TRACK_REGION_TOO_FEW_PIXELS: return "too few pixels";
     case TRACK_REGION_OUT_OF_VIEW: return "out of view";
+    case kStatusUnreadable: return "unreadable";
     default: return "status " + std::to_string(status);
     }
 }
 
 namespace {
+
+// A number of a JSON file that must be finite, and an integer within [lo, hi] when asked.
+double number_from(const json &j, const std::string &what)
+{
+    if (!j.is_number()) throw ToolError(what + " is not a number");
+    double v = j.get<double>();
+    if (!std::isfinite(v)) throw ToolError(what + " is not finite");
+    return v;
+}
+
+int64_t integer_from(const json &j, const std::string &what, int64_t lo, int64_t hi)
+{
+    if (!j.is_number_integer()) throw ToolError(what + " is not a whole number");
+    // Unsigned values above the signed range would wrap in the signed read.
+    if (j.is_number_unsigned() && j.get<uint64_t>() > static_cast<uint64_t>(hi))
+        throw ToolError(what + " is out of range");
+    int64_t v = j.get<int64_t>();
+    if (v < lo || v > hi) throw ToolError(what + " " + std::to_string(v) + " is out of range");
+    return v;
+}
 
 nlohmann::ordered_json quad_json(const Quad &q)
 {
@@ -43,26 +65,10 @@ Quad quad_from(const json &j, const std::string &what)
         const json &p = j[i];
         if (!p.is_array() || p.size() != 2 || !p[0].is_number() || !p[1].is_number())
             throw ToolError(what + " corner " + std::to_string(i + 1) + " is not [x, y]");
-        q[i] = {p[0].get<double>(), p[1].get<double>()};
+        const std::string name = what + " corner " + std::to_string(i + 1);
+        q[i] = {number_from(p[0], name), number_from(p[1], name)};
     }
     return q;
-}
-
-// Opens for writing, making the folders on the way.
-std::ofstream open_out(const std::string &path)
-{
-    std::filesystem::path parent = std::filesystem::path(path).parent_path();
-    std::error_code ec;
-    if (!parent.empty()) std::filesystem::create_directories(parent, ec);
-    std::ofstream out(path);
-    if (!out) throw ToolError("cannot write '" + path + "'");
-    return out;
-}
-
-void finish(std::ofstream &out, const std::string &path)
-{
-    out.close();
-    if (!out) throw ToolError("cannot write '" + path + "' (disk full?)");
 }
 
 }  // namespace
@@ -94,60 +100,68 @@ void write_json(const std::string &path, const TrackResult &r)
         jf["rms_residual"] = std::isfinite(f.rms_residual) ? json(f.rms_residual) : json(nullptr);
         jf["information"] = f.information.empty() ? json(nullptr) : json(f.information);
         if (f.true_corners) jf["true_corners"] = quad_json(*f.true_corners);
+        if (!f.reason.empty()) jf["reason"] = f.reason;
         frames.push_back(jf);
     }
     j["frames"] = frames;
-    std::ofstream out = open_out(path);
-    out << j.dump(2) << '\n';
-    finish(out, path);
+    write_text_atomically(path, j.dump(2) + '\n');
 }
 
 TrackResult read_json(const std::string &path)
 {
-    std::ifstream in(path);
-    if (!in) throw ToolError("cannot read '" + path + "': no such file");
+    std::string text = read_text_file(path, kMaxTextBytes);
     TrackResult r;
     try {
-        json j = json::parse(in);
+        json j = json::parse(text);
+        if (!j.is_object()) throw ToolError("not a JSON object");
         r.sequence = j.value("sequence", "");
-        r.width = j.at("width").get<int32_t>();
-        r.height = j.at("height").get<int32_t>();
-        r.reference_frame = j.value("reference_frame", 0);
+        r.width = static_cast<int32_t>(integer_from(j.at("width"), "width", 1, INT32_MAX));
+        r.height = static_cast<int32_t>(integer_from(j.at("height"), "height", 1, INT32_MAX));
+        if (int64_t{r.width} * r.height > kMaxImagePixels) throw ToolError("image size is too large");
+        if (j.contains("reference_frame"))
+            r.reference_frame = static_cast<int>(integer_from(j["reference_frame"], "reference_frame", INT32_MIN, INT32_MAX));
         r.model = j.value("model", "");
         if (j.contains("reference_quad")) r.reference_quad = quad_from(j["reference_quad"], "reference_quad");
         r.complete = j.value("complete", true);
         r.stopped = j.value("stopped", "");
-        for (const json &jf : j.at("frames")) {
+        const json &frames = j.at("frames");
+        if (!frames.is_array()) throw ToolError("frames is not a list");
+        for (const json &jf : frames) {
             FrameResult f;
-            f.frame = jf.at("frame").get<int>();
-            f.status = jf.value("status_code", 0u);
+            f.frame = static_cast<int>(integer_from(jf.at("frame"), "frame", INT32_MIN, INT32_MAX));
+            const std::string at = "frame " + std::to_string(f.frame);
+            if (!r.frames.empty() && f.frame <= r.frames.back().frame)
+                throw ToolError(at + " is out of order or listed twice");
+            f.status = jf.contains("status_code")
+                           ? static_cast<uint32_t>(integer_from(jf["status_code"], at + " status_code", 0, UINT32_MAX))
+                           : 0u;
             const json &h = jf.at("homography");
-            if (!h.is_array() || h.size() != 3) throw ToolError("homography is not 3x3");
+            if (!h.is_array() || h.size() != 3) throw ToolError(at + " homography is not 3x3");
             for (int i = 0; i < 3; ++i) {
-                if (!h[i].is_array() || h[i].size() != 3) throw ToolError("homography is not 3x3");
-                for (int k = 0; k < 3; ++k) f.homography.m[i][k] = h[i][k].get<double>();
+                if (!h[i].is_array() || h[i].size() != 3) throw ToolError(at + " homography is not 3x3");
+                for (int k = 0; k < 3; ++k) f.homography.m[i][k] = number_from(h[i][k], at + " homography");
             }
-            f.corners = quad_from(jf.at("corners"), "corners");
+            f.corners = quad_from(jf.at("corners"), at + " corners");
             f.rms_residual = jf.contains("rms_residual") && jf["rms_residual"].is_number()
                                  ? jf["rms_residual"].get<double>()
                                  : INFINITY;
             if (jf.contains("information") && jf["information"].is_array())
                 f.information = jf["information"].get<std::vector<std::vector<double>>>();
-            if (jf.contains("true_corners")) f.true_corners = quad_from(jf["true_corners"], "true_corners");
+            if (jf.contains("true_corners")) f.true_corners = quad_from(jf["true_corners"], at + " true_corners");
+            if (jf.contains("reason") && jf["reason"].is_string()) f.reason = jf["reason"].get<std::string>();
             r.frames.push_back(f);
         }
     } catch (const json::exception &e) {
-        throw ToolError("'" + path + "' is not a tracking result: " + e.what());
+        throw ToolError("'" + path + "' is not a tracking result: " + one_line(e.what()));
     } catch (const ToolError &e) {
         throw ToolError("'" + path + "' is not a tracking result: " + e.what());
     }
-    if (r.width < 1 || r.height < 1) throw ToolError("'" + path + "' has no image size");
     return r;
 }
 
 void write_csv(const std::string &path, const TrackResult &r)
 {
-    std::ofstream out = open_out(path);
+    std::ostringstream out;
     out << "frame,status,rms_residual,x1,y1,x2,y2,x3,y3,x4,y4,h00,h01,h02,h10,h11,h12,h20,h21,h22\n";
     char buffer[64];
     for (const FrameResult &f : r.frames) {
@@ -167,7 +181,7 @@ void write_csv(const std::string &path, const TrackResult &r)
             }
         out << '\n';
     }
-    finish(out, path);
+    write_text_atomically(path, out.str());
 }
 
 void write_script(const std::string &path, const TrackResult &r, const std::string &node_name)
@@ -193,24 +207,42 @@ void write_script(const std::string &path, const TrackResult &r, const std::stri
         }
     }
     if (keys->size == 0) throw ToolError("no tracked frame to write to '" + path + "'");
-    check(bWriteShakeMatchMoveFile(path.c_str(), r.height, r.width, node_name.c_str(), keys, 1.0),
-          "cannot write '" + path + "'");
+    write_atomically(path, [&](const std::string &temporary) {
+        check(bWriteShakeMatchMoveFile(temporary.c_str(), r.height, r.width, node_name.c_str(), keys, 1.0),
+              "cannot write '" + path + "'");
+    });
 }
 
 std::map<int, Quad> read_script(const std::string &path, int32_t width, int32_t height)
 {
+    check_input_file(path, kMaxScriptBytes);
     Plx_List *keys = nullptr;
     char name[256];
     check(bReadShakeMatchMoveFile(path.c_str(), &height, &width, name, sizeof name, &keys),
           "cannot read '" + path + "'");
+    struct ListGuard {
+        Plx_List *list;
+        ~ListGuard() { plx_list_free(list, free); }
+    } guard{keys};
+    // The reader takes what its format allows; the tool takes only what a writer would write.
+    auto refuse = [&](const std::string &why) -> void { throw ToolError("'" + path + "' " + why); };
+    if (width < 1 || height < 1) refuse("has image dimensions " + std::to_string(width) + "x" + std::to_string(height));
+    if (keys->size == 0) refuse("has no keys");
     std::map<int, Quad> out;
     for (const Plx_ListNode *n = keys->head; n != nullptr; n = n->next) {
         const auto *key = static_cast<const MatchMoveKey *>(n->data);
+        if (key->frame > static_cast<uint32_t>(INT32_MAX)) refuse("has frame " + std::to_string(key->frame) + ", out of range");
+        int frame = static_cast<int>(key->frame);
+        if (!out.empty() && frame <= out.rbegin()->first)
+            refuse("has frame " + std::to_string(frame) + " out of order or twice");
         Quad q;
-        for (int i = 0; i < 4; ++i) q[i] = {key->corners[i][0], key->corners[i][1]};
-        out[static_cast<int>(key->frame)] = q;
+        for (int i = 0; i < 4; ++i) {
+            q[i] = {key->corners[i][0], key->corners[i][1]};
+            if (!std::isfinite(q[i].x) || !std::isfinite(q[i].y))
+                refuse("has a corner that is not a finite number at frame " + std::to_string(frame));
+        }
+        out[frame] = q;
     }
-    plx_list_free(keys, free);
     return out;
 }
 

@@ -11,6 +11,9 @@
 
 namespace plano_tool {
 
+// The status of a frame whose plate could not be read (the engine's statuses are below it).
+constexpr uint32_t kStatusUnreadable = 100;
+
 struct FrameResult {
     int frame = 0;
     uint32_t status = 0;                    // TrackRegionStatus; 0 is tracked
@@ -19,6 +22,7 @@ struct FrameResult {
     double rms_residual = 0;
     std::vector<std::vector<double>> information;  // empty when not known
     std::optional<Quad> true_corners;       // the demo's known answer
+    std::string reason;                     // why the frame was not tracked, when known
 };
 
 struct TrackResult {
@@ -35,6 +39,7 @@ struct TrackResult {
 // Name of a region status ("ok", "lost", "no match", ...).
 std::string status_name(uint32_t status);
 
+// The files are written atomically (see write_atomically).
 void write_json(const std::string &path, const TrackResult &result);
 TrackResult read_json(const std::string &path);
 // One line per frame: frame, status, rms residual, the corners, the homography row by row.
@@ -42,6 +47,8 @@ void write_csv(const std::string &path, const TrackResult &result);
 // The tracked frames (status 0) as a four-corner match-move script.
 void write_script(const std::string &path, const TrackResult &result, const std::string &node_name);
 // Corners per frame of a script; the caller's size stands in when it has no dimensions line.
+// Refuses what a writer never writes: no keys, frames out of order, twice or beyond the int
+// range, corners that are not finite, dimensions below 1.
 std::map<int, Quad> read_script(const std::string &path, int32_t width, int32_t height);
 
 }  // namespace plano_tool
