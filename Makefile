@@ -3,8 +3,11 @@ BUILD ?= build
 JOBS ?= 2
 PACKAGES = cmake g++ make pkg-config ccache libeigen3-dev libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev libopenimageio-dev
 PEER_PACKAGES = libopencv-dev libceres-dev
+FUZZ_PACKAGES = clang libclang-rt-14-dev
+FUZZ_SECONDS ?= 60
+FUZZ_TARGETS = fuzz_matchmove_reader fuzz_track_json
 
-.PHONY: setup build test demo bench sanitize clean
+.PHONY: setup build test demo bench sanitize fuzz clean
 
 setup:
 	@bash scripts/install-packages.sh $(PACKAGES)
@@ -32,6 +35,15 @@ sanitize: setup
 	cmake -S . -B $(BUILD)-asan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DPLANO_SANITIZE=ON -DPLANO_BENCH=OFF
 	cmake --build $(BUILD)-asan -j$(JOBS)
 	cd $(BUILD)-asan && ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 ctest --output-on-failure -j$(JOBS)
+
+# The readers of outside input under libFuzzer, AddressSanitizer and UndefinedBehaviorSanitizer,
+# FUZZ_SECONDS each; a crash, leak or timeout fails the target (fuzz/run.sh).
+fuzz: setup
+	@bash scripts/install-packages.sh $(FUZZ_PACKAGES)
+	cmake -S . -B $(BUILD)-fuzz -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ \
+	  -DCMAKE_BUILD_TYPE=RelWithDebInfo -DPLANO_FUZZ=ON -DPLANO_TESTS=OFF -DPLANO_BENCH=OFF
+	cmake --build $(BUILD)-fuzz -j$(JOBS) --target $(FUZZ_TARGETS)
+	bash fuzz/run.sh $(BUILD)-fuzz $(FUZZ_SECONDS) $(FUZZ_TARGETS)
 
 clean:
 	rm -rf $(BUILD) $(BUILD)-asan

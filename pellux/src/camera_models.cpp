@@ -46,7 +46,6 @@ Plx_Bool fail(int32_t *error_code, const char *name, int32_t code, int line)
 struct LinearModel {
     static constexpr bool identity = true;
     static constexpr bool affine = false;
-    static constexpr bool add_closed = true;
     static constexpr int coeffs = 0;
 };
 

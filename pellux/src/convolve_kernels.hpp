@@ -20,6 +20,15 @@
 #include <immintrin.h>
 #endif
 
+// Keeps a function's products and sums unfused whatever the build flags. clang has no such
+// per-function switch; it is given -ffp-contract=off for the whole build instead
+// (cmake/PlanoWarnings.cmake).
+#if defined(__clang__)
+#define PLX_NO_FP_CONTRACT
+#else
+#define PLX_NO_FP_CONTRACT gnu::optimize("fp-contract=off")
+#endif
+
 namespace plx::conv {
 
 enum class Isa { baseline, avx2 };
@@ -184,10 +193,18 @@ template <class A, bool Sym, bool Stream = false>
             a3 += kt * x3;
         }
         if constexpr (Stream) {
+#if defined(__clang__)
+            // clang has no GCC's store builtin but a generic one, which becomes vmovntps here.
+            __builtin_nontemporal_store(a0, reinterpret_cast<V *>(out + i));
+            __builtin_nontemporal_store(a1, reinterpret_cast<V *>(out + i + W));
+            __builtin_nontemporal_store(a2, reinterpret_cast<V *>(out + i + 2 * W));
+            __builtin_nontemporal_store(a3, reinterpret_cast<V *>(out + i + 3 * W));
+#else
             __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i), reinterpret_cast<__v8sf>(a0));
             __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + W), reinterpret_cast<__v8sf>(a1));
             __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + 2 * W), reinterpret_cast<__v8sf>(a2));
             __builtin_ia32_movntps256(reinterpret_cast<float *>(out + i + 3 * W), reinterpret_cast<__v8sf>(a3));
+#endif
         } else {
         std::memcpy(out + i, &a0, sizeof a0);
         std::memcpy(out + i + W, &a1, sizeof a1);
@@ -216,8 +233,8 @@ template <class A, bool Sym, bool Stream = false>
 
 // n a multiple of Lanes<A>::W. Fixed point (A = uint16_t) needs a symmetric mask.
 template <class A, bool Sym>
-[[gnu::optimize("fp-contract=off")]] void taps_baseline(A *out, const A *const *src, const A *k, uint32_t ntaps,
-                                                        std::size_t n)
+[[PLX_NO_FP_CONTRACT]] void taps_baseline(A *out, const A *const *src, const A *k, uint32_t ntaps,
+                                          std::size_t n)
 {
     if constexpr (std::is_same_v<A, uint16_t>) {
 #ifdef PLX_CONV_X86
@@ -234,8 +251,8 @@ template <class A, bool Sym>
 // Stream: float results go straight to memory (non-temporal stores) when out is aligned, for
 // outputs that are not read again soon; the values are the same.
 template <class A, bool Sym, bool Stream = false>
-[[gnu::target("avx2"), gnu::optimize("fp-contract=off")]] void taps_avx2(A *out, const A *const *src, const A *k,
-                                                                         uint32_t ntaps, std::size_t n)
+[[gnu::target("avx2"), PLX_NO_FP_CONTRACT]] void taps_avx2(A *out, const A *const *src, const A *k,
+                                                           uint32_t ntaps, std::size_t n)
 {
     if constexpr (std::is_same_v<A, uint16_t>) {
         fixed_taps_avx2(out, src, k, ntaps, n);

@@ -285,14 +285,14 @@ PLX_INLINE void run_pass(const Pass &p, const Scratch<A> &s)
 // The pass compiled once per instruction set (conversions vectorise wider with AVX2); the
 // arithmetic is the same in both, products and sums never fused.
 template <class T, class A, bool Sym, bool AlongY>
-[[gnu::optimize("fp-contract=off")]] void run_pass_baseline(const Pass &p, const Scratch<A> &s)
+[[PLX_NO_FP_CONTRACT]] void run_pass_baseline(const Pass &p, const Scratch<A> &s)
 {
     run_pass<T, A, Sym, AlongY, Isa::baseline>(p, s);
 }
 
 #ifdef PLX_CONV_X86
 template <class T, class A, bool Sym, bool AlongY>
-[[gnu::target("avx2"), gnu::optimize("fp-contract=off")]] void run_pass_avx2(const Pass &p, const Scratch<A> &s)
+[[gnu::target("avx2"), PLX_NO_FP_CONTRACT]] void run_pass_avx2(const Pass &p, const Scratch<A> &s)
 {
     run_pass<T, A, Sym, AlongY, Isa::avx2>(p, s);
 }

@@ -277,8 +277,13 @@ ReadResult parse_script(const std::string &text, int32_t height, int32_t width, 
     return result;
 }
 
+// Far more than any shot's keys take (a frame costs under 200 bytes); past it the input is
+// taken for an endless device or pipe.
+constexpr size_t kMostScriptBytes = size_t{1} << 30;
+
 // Reads the whole file, except that one whose first byte cannot start a script is not read
-// on (an endless device or a large binary file fails at once).
+// on (a large binary file or a device of zeros fails at once). False when it cannot be read
+// or is larger than any script.
 bool read_file(FILE *file, std::string &text)
 {
     char buffer[65536];
@@ -286,6 +291,7 @@ bool read_file(FILE *file, std::string &text)
     while ((n = std::fread(buffer, 1, sizeof buffer, file)) > 0) {
         text.append(buffer, n);
         if (text[0] != '#') break;
+        if (text.size() > kMostScriptBytes) return false;
     }
     return !std::ferror(file);
 }
@@ -445,7 +451,8 @@ PLANO_API Plx_Bool bReadShakeMatchMoveFile(const char *path, int32_t *height, in
         }
         std::string text;
         if (!read_file(file.get(), text)) {
-            PLX_ERR_START(PLX_ERROR_CORRUPTED_FILE, "read error", 0);
+            PLX_ERR_START(PLX_ERROR_CORRUPTED_FILE, "read error or larger than any script; number: bytes read",
+                          static_cast<int64_t>(text.size()));
             return PLX_FALSE;
         }
         file.reset();

@@ -212,8 +212,13 @@ struct V {
 
 }  // namespace portable
 
+// Everything of the AVX2 pack is compiled for AVX2; each compiler has its own spelling.
+#if defined(__clang__)
+#pragma clang attribute push(__attribute__((target("avx2"))), apply_to = function)
+#else
 #pragma GCC push_options
 #pragma GCC target("avx2")
+#endif
 namespace avx2 {
 
 // Eight lanes in AVX2 registers: the same operations as the portable pack (no fused
@@ -329,7 +334,11 @@ struct V {
 #include "track/pixel_match_block.inc"
 
 }  // namespace avx2
+#if defined(__clang__)
+#pragma clang attribute pop
+#else
 #pragma GCC pop_options
+#endif
 
 inline bool avx2_available()
 {

@@ -159,6 +159,9 @@ TEST_F(ToolSafety, HostileInputsAreRefused)
     json wrapped = json::parse(slurp(dir_ / "demo/track.json"));
     wrapped["frames"][1]["frame"] = 99999999999;
     std::ofstream(dir_ / "wrapped.json") << wrapped.dump();
+    json ragged = json::parse(slurp(dir_ / "demo/track.json"));
+    ragged["frames"][1]["information"] = {{1, 0}, {0}};
+    std::ofstream(dir_ / "ragged.json") << ragged.dump();
     // A header-only image far over the pixel cap: refused before its pixels are read.
     std::ofstream(dir_ / "big.pgm") << "P5\n20000 20000\n255\n" << std::string(64, '\0');
 
@@ -175,6 +178,7 @@ TEST_F(ToolSafety, HostileInputsAreRefused)
         {{"track", "-s", kPlates, "--init-from", "/dev/zero"}, "not a regular file"},
         {{"track", "-s", kPlates, "--mask", "big.pgm"}, "million pixels"},
         {{"overlay", "-t", "wrapped.json", "-o", "o/%04d.png"}, "out of range"},
+        {{"overlay", "-t", "ragged.json", "-o", "o/%04d.png"}, "not a square matrix"},
         {{"overlay", "-t", "demo/track.json", "-o", "o/%04d.png", "--colour", "nan,0,0"}, "not three numbers"},
         {{"overlay", "-t", "demo/track.json", "-o", "o/%04d.png", "--thickness", "nan"}, "thickness"},
         {{"insert", "-t", "demo/track.json", "-i", "demo/card.png", "-o", "o/%04d.png", "--feather", "inf"}, "feather"},

@@ -98,7 +98,11 @@ void write_json(const std::string &path, const TrackResult &r)
         jf["corners"] = quad_json(f.corners);
         // JSON has no infinities: an unknown residual is null.
         jf["rms_residual"] = std::isfinite(f.rms_residual) ? json(f.rms_residual) : json(nullptr);
-        jf["information"] = f.information.empty() ? json(nullptr) : json(f.information);
+        // JSON has no NaN or infinity either: information with one is not known.
+        bool finite = true;
+        for (const auto &row : f.information)
+            for (double v : row) finite = finite && std::isfinite(v);
+        jf["information"] = f.information.empty() || !finite ? json(nullptr) : json(f.information);
         if (f.true_corners) jf["true_corners"] = quad_json(*f.true_corners);
         if (!f.reason.empty()) jf["reason"] = f.reason;
         frames.push_back(jf);
@@ -142,11 +146,22 @@ TrackResult read_json(const std::string &path)
                 for (int k = 0; k < 3; ++k) f.homography.m[i][k] = number_from(h[i][k], at + " homography");
             }
             f.corners = quad_from(jf.at("corners"), at + " corners");
-            f.rms_residual = jf.contains("rms_residual") && jf["rms_residual"].is_number()
-                                 ? jf["rms_residual"].get<double>()
-                                 : INFINITY;
-            if (jf.contains("information") && jf["information"].is_array())
-                f.information = jf["information"].get<std::vector<std::vector<double>>>();
+            // Null (or absent) stands for a residual or information that is not known.
+            f.rms_residual = INFINITY;
+            if (jf.contains("rms_residual") && !jf["rms_residual"].is_null()) {
+                f.rms_residual = number_from(jf["rms_residual"], at + " rms_residual");
+                if (f.rms_residual < 0) throw ToolError(at + " rms_residual is negative");
+            }
+            if (jf.contains("information") && !jf["information"].is_null()) {
+                const json &info = jf["information"];
+                if (!info.is_array() || info.size() > 16) throw ToolError(at + " information is not a square matrix");
+                for (const json &row : info) {
+                    if (!row.is_array() || row.size() != info.size())
+                        throw ToolError(at + " information is not a square matrix");
+                    f.information.emplace_back();
+                    for (const json &v : row) f.information.back().push_back(number_from(v, at + " information"));
+                }
+            }
             if (jf.contains("true_corners")) f.true_corners = quad_from(jf["true_corners"], at + " true_corners");
             if (jf.contains("reason") && jf["reason"].is_string()) f.reason = jf["reason"].get<std::string>();
             r.frames.push_back(f);
