@@ -15,5 +15,6 @@
 #include "plano/track_correlation.h"
 #include "plano/track_homography.h"
 #include "plano/matchmove.h"
+#include "plano/polygon_fill.h"
 
 #endif
