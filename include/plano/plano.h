@@ -16,5 +16,6 @@
 #include "plano/track_homography.h"
 #include "plano/matchmove.h"
 #include "plano/polygon_fill.h"
+#include "plano/stabilise.h"
 
 #endif

@@ -24,13 +24,6 @@ struct DemoOptions {
     bool quiet = false;
 };
 
-Plx_Matrix33 multiply(const Plx_Matrix33 &A, const Plx_Matrix33 &B)
-{
-    Plx_Matrix33 AB;
-    plx_mat33_rmultm33_s(&A, &B, &AB);
-    return AB;
-}
-
 // Plate positions of frame f to photograph positions: the virtual camera pans, turns, moves
 // in and tilts a little over the shot.
 Plx_Matrix33 camera_move(int f, int frames, int32_t photo_width, int32_t photo_height)
@@ -135,9 +128,7 @@ int run_demo(const DemoOptions &o)
     double error_sum = 0, error_max = 0;
     int error_count = 0;
     for (int f = 1; f <= o.frames; ++f) {
-        Plx_Matrix33 inverse;
-        check(plx_mat33_invert_s(&move[f - 1], &inverse), "camera move");
-        Plx_Matrix33 truth = multiply(inverse, to_photo_1);
+        Plx_Matrix33 truth = multiply(inverse(move[f - 1]), to_photo_1);
         Quad true_corners = map_through(truth, job.reference_quad);
         FrameResult *found = nullptr;
         for (FrameResult &r : result.frames)

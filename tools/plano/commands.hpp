@@ -17,6 +17,7 @@ namespace plano_tool {
 void add_track_command(CLI::App &app, int &exit_code);
 void add_insert_command(CLI::App &app, int &exit_code);
 void add_overlay_command(CLI::App &app, int &exit_code);
+void add_stabilise_command(CLI::App &app, int &exit_code);
 void add_demo_command(CLI::App &app, int &exit_code);
 
 // What `plano track` (and the demo) ask of the tracker.

@@ -67,6 +67,20 @@ Quad map_through(const Plx_Matrix33 &H, const Quad &quad)
     return out;
 }
 
+Plx_Matrix33 multiply(const Plx_Matrix33 &A, const Plx_Matrix33 &B)
+{
+    Plx_Matrix33 AB;
+    plx_mat33_rmultm33_s(&A, &B, &AB);
+    return AB;
+}
+
+Plx_Matrix33 inverse(const Plx_Matrix33 &A)
+{
+    Plx_Matrix33 inverted;
+    check(plx_mat33_invert_s(&A, &inverted), "homography inverse");
+    return inverted;
+}
+
 Plx_Matrix33 homography_between(const Quad &from, const Quad &to)
 {
     // bTex2Scene takes corners in the unit square's order: 1, 2, 4, 3 around the edge.

@@ -29,6 +29,9 @@ Quad quad_of_mask(const Plx_Image &mask);
 
 Point map_through(const Plx_Matrix33 &H, Point p);
 Quad map_through(const Plx_Matrix33 &H, const Quad &quad);
+// A times B, and the inverse of A (throws when A is singular).
+Plx_Matrix33 multiply(const Plx_Matrix33 &A, const Plx_Matrix33 &B);
+Plx_Matrix33 inverse(const Plx_Matrix33 &A);
 // The homography taking each corner of `from` onto the same corner of `to`.
 Plx_Matrix33 homography_between(const Quad &from, const Quad &to);
 // The corners of a width x height image, top-left first, clockwise on screen.

@@ -18,6 +18,7 @@ int main(int argc, char **argv)
     add_track_command(app, exit_code);
     add_insert_command(app, exit_code);
     add_overlay_command(app, exit_code);
+    add_stabilise_command(app, exit_code);
     add_demo_command(app, exit_code);
     if (argc < 2) {
         std::fputs(app.help().c_str(), stdout);
