@@ -16,6 +16,8 @@
 #include "plano/track_homography.h"
 #include "plano/matchmove.h"
 #include "plano/polygon_fill.h"
+#include "plano/xspline.h"
+#include "plano/bezier.h"
 #include "plano/stabilise.h"
 
 #endif
