@@ -265,6 +265,9 @@ void write_image(const std::string &path, const Plx_Image &source)
         OIIO::ImageSpec spec(image->width, image->height, channels, oiio_type(type));
         if (channels == 2) spec.alpha_channel = 1;
         if (channels == 4) spec.alpha_channel = 3;
+        // PNG frames are review and proxy output: zlib's fastest level writes them three times
+        // faster than the default for files about 15 % larger (OpenCV writes at this level too).
+        spec.attribute("png:compressionLevel", 1);
         OIIO::stride_t pixel_bytes = static_cast<OIIO::stride_t>(channels * plx_image_type_size(type));
         if (!out->open(temporary, spec) ||
             !out->write_image(oiio_type(type), image->data, pixel_bytes, image->stride) || !out->close())
