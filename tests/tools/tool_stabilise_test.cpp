@@ -4,6 +4,7 @@
 
 #include <cmath>
 
+#include "plano/plano.h"
 #include "tool_test_util.hpp"
 
 namespace {
@@ -11,21 +12,26 @@ namespace {
 using namespace tool_test;
 using nlohmann::json;
 
-using M3 = std::array<std::array<double, 3>, 3>;
+using M3 = Plx_Matrix33;
 
 M3 mul(const M3 &a, const M3 &b)
 {
-    M3 c{};
-    for (int i = 0; i < 3; ++i)
-        for (int k = 0; k < 3; ++k)
-            for (int j = 0; j < 3; ++j) c[i][k] += a[i][j] * b[j][k];
+    M3 c;
+    plx_mat33_rmultm33_s(&a, &b, &c);
     return c;
+}
+
+M3 invert(const M3 &a)
+{
+    M3 inverse{};
+    EXPECT_TRUE(plx_mat33_invert_s(&a, &inverse));
+    return inverse;
 }
 
 std::array<double, 2> apply(const M3 &h, double x, double y)
 {
-    double w = h[2][0] * x + h[2][1] * y + h[2][2];
-    return {(h[0][0] * x + h[0][1] * y + h[0][2]) / w, (h[1][0] * x + h[1][1] * y + h[1][2]) / w};
+    double w = h.m[2][0] * x + h.m[2][1] * y + h.m[2][2];
+    return {(h.m[0][0] * x + h.m[0][1] * y + h.m[0][2]) / w, (h.m[1][0] * x + h.m[1][1] * y + h.m[1][2]) / w};
 }
 
 // Rotation by angle (radians) about (cx, cy), then translation by (tx, ty).
@@ -93,14 +99,8 @@ TEST(ToolStabilise, ShakyShotFollowsItsSmoothPath)
     for (int f = 1; f <= kFrames; ++f) {
         M3 F;
         for (int i = 0; i < 3; ++i)
-            for (int k = 0; k < 3; ++k) F[i][k] = stab["frames"][f - 1]["stabilise"][i][k].get<double>();
+            for (int k = 0; k < 3; ++k) F.m[i][k] = stab["frames"][f - 1]["stabilise"][i][k].get<double>();
         const M3 shaky = camera(f, true, photo.width, photo.height), smooth = camera(f, false, photo.width, photo.height);
-        // Photograph to plate: the inverses of the similarities above.
-        auto invert = [](const M3 &m) {
-            double c = m[0][0], s = m[1][0];
-            double d = c * c + s * s;
-            return M3{{{c / d, s / d, -(c * m[0][2] + s * m[1][2]) / d}, {-s / d, c / d, (s * m[0][2] - c * m[1][2]) / d}, {0, 0, 1}}};
-        };
         for (auto [u, v] : {std::pair{80.0, 60.0}, std::pair{240.0, 60.0}, std::pair{160.0, 100.0}, std::pair{90.0, 150.0}}) {
             auto X = apply(camera(1, false, photo.width, photo.height), u, v);
             auto in_plate = apply(invert(shaky), X[0], X[1]);

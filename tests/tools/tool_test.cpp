@@ -248,15 +248,7 @@ TEST(ToolErrors, OneLineAndNonZero)
         {{"insert", "-i", "demo/card.png", "-o", "o/%04d.png"}, "--track is required"},
         {{"nonsense"}, "plano: "},
     };
-    for (const Case &c : cases) {
-        ToolRun r = run_tool(dir, c.args);
-        std::string what = c.args[0] + " ... " + c.says;
-        EXPECT_NE(r.code, 0) << what;
-        EXPECT_LT(r.code, 256) << what << " (crashed?)";
-        EXPECT_EQ(r.error_lines(), 1u) << what << ": " << r.err;
-        EXPECT_EQ(r.err.rfind("plano", 0), 0u) << r.err;
-        EXPECT_NE(r.err.find(c.says), std::string::npos) << what << ": " << r.err;
-    }
+    for (const Case &c : cases) expect_one_line_failure(run_tool(dir, c.args), c.says);
     // Failures before the first frame leave no output behind; a failure at a later frame
     // keeps the frames before it (and says which frame failed).
     EXPECT_FALSE(fs::exists(dir / "o"));
@@ -331,12 +323,7 @@ TEST(ToolTrack, FailuresAreOneLine)
         {{"track", "-s", plates, "-f", "1-5", "--quad", "10,10,100,10,100,100,10,100"}, 1, "no such file"},
         {{"track", "-s", plates, "--quad", "10,10,100,10,100,100,10,100", "-m", "bendy"}, 1, "unknown motion model"},
     };
-    for (const Case &c : cases) {
-        ToolRun r = run_tool(dir, c.args);
-        EXPECT_EQ(r.code, c.code) << c.says << ": " << r.err;
-        EXPECT_EQ(r.error_lines(), 1u) << r.err;
-        EXPECT_NE(r.err.find(c.says), std::string::npos) << r.err;
-    }
+    for (const Case &c : cases) expect_one_line_failure(run_tool(dir, c.args), c.says, c.code);
 
     // A region that disappears: frame 3 is black. Tracking stops there, says so and keeps
     // what it had.
@@ -344,9 +331,7 @@ TEST(ToolTrack, FailuresAreOneLine)
     std::fill(black.data.begin(), black.data.end(), 0.0f);
     write_pixels(dir / "demo" / "plates" / "frame.0003.png", black, OIIO::TypeDesc::UINT8);
     ToolRun r = run_tool(dir, {"track", "-s", plates, "--quad", "120,60,280,60,280,200,120,200", "-o", "lost.json", "-q"});
-    EXPECT_EQ(r.code, 3) << r.err;
-    EXPECT_EQ(r.error_lines(), 1u) << r.err;
-    EXPECT_NE(r.err.find("lost at frame 3"), std::string::npos) << r.err;
+    expect_one_line_failure(r, "lost at frame 3", 3);
     json lost = track_of(dir / "lost.json");
     EXPECT_FALSE(lost["complete"].get<bool>());
     ASSERT_EQ(lost["frames"].size(), 3u);

@@ -82,6 +82,21 @@ inline ToolRun run_tool(const fs::path &dir, const std::vector<std::string> &arg
     return r;
 }
 
+// A failure as the tool reports one: exit code `code` (0: any failure code, but not a crash),
+// one line on stderr that starts with "plano" and holds `says`.
+inline void expect_one_line_failure(const ToolRun &r, const std::string &says, int code = 0)
+{
+    if (code != 0) {
+        EXPECT_EQ(r.code, code) << says << ": " << r.err;
+    } else {
+        EXPECT_NE(r.code, 0) << says;
+        EXPECT_LT(r.code, 256) << says << " (crashed?)";
+    }
+    EXPECT_EQ(r.error_lines(), 1u) << says << ": " << r.err;
+    EXPECT_EQ(r.err.rfind("plano", 0), 0u) << r.err;
+    EXPECT_NE(r.err.find(says), std::string::npos) << says << ": " << r.err;
+}
+
 struct Pixels {
     int width = 0, height = 0, channels = 0;
     OIIO::TypeDesc format;

@@ -60,22 +60,6 @@ std::array<int32_t, 8> component_flags(const std::string &text)
 
 Plx_Matrix33 affine(double s, double tx, double ty) { return {{{s, 0, tx}, {0, s, ty}, {0, 0, 1}}}; }
 
-// Scaled so that the last entry is 1, as the track's homographies are.
-Plx_Matrix33 normalised(Plx_Matrix33 H)
-{
-    if (std::fabs(H.m[2][2]) > 1e-300)
-        for (auto &row : H.m)
-            for (double &v : row) v /= H.m[2][2];
-    return H;
-}
-
-nlohmann::ordered_json matrix_json(const Plx_Matrix33 &H)
-{
-    nlohmann::ordered_json rows = nlohmann::ordered_json::array();
-    for (const auto &row : H.m) rows.push_back({row[0], row[1], row[2]});
-    return rows;
-}
-
 // The anchor flags, one per frame of the track: the listed frames, every n-th frame (and the
 // last), or by default the track's reference frame.
 std::vector<uint32_t> anchor_flags(const StabiliseOptions &o, const TrackResult &track)
@@ -183,7 +167,7 @@ int run_stabilise(const StabiliseOptions &o)
     paths.check();
 
     std::vector<Plx_Matrix33> to_output(n);
-    for (size_t i = 0; i < n; ++i) to_output[i] = normalised(multiply(framing.to_output, to_stable[i]));
+    for (size_t i = 0; i < n; ++i) to_output[i] = with_unit_h22(multiply(framing.to_output, to_stable[i]));
     if (!o.json.empty()) {
         using json = nlohmann::ordered_json;
         json j;
@@ -203,7 +187,7 @@ int run_stabilise(const StabiliseOptions &o)
             json jf;
             jf["frame"] = first + int(i);
             jf["stabilise"] = matrix_json(to_output[i]);
-            jf["inverse"] = matrix_json(normalised(inverse(to_output[i])));
+            jf["inverse"] = matrix_json(with_unit_h22(inverse(to_output[i])));
             list.push_back(jf);
         }
         j["frames"] = list;

@@ -97,10 +97,7 @@ FrameResult track_pair(const TrackJob &job, const Plx_Image &reference, const Pl
     if (out.status != TRACK_REGION_OK) return out;
     bTrackMotionRead(region, &out.homography);
     // The engine scales a projective H to unit norm; files carry it with H22 = 1 as people expect.
-    double h22 = out.homography.m[2][2];
-    if (std::fabs(h22) > 1e-12)
-        for (auto &row : out.homography.m)
-            for (double &v : row) v /= h22;
+    out.homography = with_unit_h22(out.homography);
     out.corners = map_through(out.homography, job.reference_quad);
     out.rms_residual = region->rms_residual;
     if (const Plx_SquMatrix *info = psmTrackInfmatRead(region)) {

@@ -81,6 +81,15 @@ Plx_Matrix33 inverse(const Plx_Matrix33 &A)
     return inverted;
 }
 
+Plx_Matrix33 with_unit_h22(Plx_Matrix33 H)
+{
+    const double h22 = H.m[2][2];
+    if (std::fabs(h22) > 1e-12)
+        for (auto &row : H.m)
+            for (double &v : row) v /= h22;
+    return H;
+}
+
 Plx_Matrix33 homography_between(const Quad &from, const Quad &to)
 {
     // bTex2Scene takes corners in the unit square's order: 1, 2, 4, 3 around the edge.

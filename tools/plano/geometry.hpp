@@ -32,6 +32,9 @@ Quad map_through(const Plx_Matrix33 &H, const Quad &quad);
 // A times B, and the inverse of A (throws when A is singular).
 Plx_Matrix33 multiply(const Plx_Matrix33 &A, const Plx_Matrix33 &B);
 Plx_Matrix33 inverse(const Plx_Matrix33 &A);
+// H scaled so that its last entry is 1, the form files carry (left as it is when that entry
+// is within 1e-12 of 0).
+Plx_Matrix33 with_unit_h22(Plx_Matrix33 H);
 // The homography taking each corner of `from` onto the same corner of `to`.
 Plx_Matrix33 homography_between(const Quad &from, const Quad &to);
 // The corners of a width x height image, top-left first, clockwise on screen.

@@ -73,6 +73,13 @@ Quad quad_from(const json &j, const std::string &what)
 
 }  // namespace
 
+nlohmann::ordered_json matrix_json(const Plx_Matrix33 &H)
+{
+    nlohmann::ordered_json rows = nlohmann::ordered_json::array();
+    for (const auto &row : H.m) rows.push_back({row[0], row[1], row[2]});
+    return rows;
+}
+
 void write_json(const std::string &path, const TrackResult &r)
 {
     // Keys in the order written, for people reading the file.
@@ -92,9 +99,7 @@ void write_json(const std::string &path, const TrackResult &r)
         jf["frame"] = f.frame;
         jf["status"] = status_name(f.status);
         jf["status_code"] = f.status;
-        json h = json::array();
-        for (const auto &row : f.homography.m) h.push_back({row[0], row[1], row[2]});
-        jf["homography"] = h;
+        jf["homography"] = matrix_json(f.homography);
         jf["corners"] = quad_json(f.corners);
         // JSON has no infinities: an unknown residual is null.
         jf["rms_residual"] = std::isfinite(f.rms_residual) ? json(f.rms_residual) : json(nullptr);

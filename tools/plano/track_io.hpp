@@ -2,6 +2,8 @@
 #ifndef PLANO_TOOL_TRACK_IO_HPP
 #define PLANO_TOOL_TRACK_IO_HPP
 
+#include <nlohmann/json.hpp>
+
 #include <map>
 #include <optional>
 #include <string>
@@ -38,6 +40,9 @@ struct TrackResult {
 
 // Name of a region status ("ok", "lost", "no match", ...).
 std::string status_name(uint32_t status);
+
+// A 3x3 matrix as JSON, row by row.
+nlohmann::ordered_json matrix_json(const Plx_Matrix33 &H);
 
 // The files are written atomically (see write_atomically).
 void write_json(const std::string &path, const TrackResult &result);
